@@ -1,0 +1,43 @@
+# Thin wrapper over CMake.  `make test` configures, builds and runs every test;
+# `make run` builds and runs the main job.
+BUILD      ?= build
+ASAN_BUILD ?= build-asan
+M32_BUILD  ?= build-m32
+JOBS       ?= $(shell nproc 2>/dev/null || echo 2)
+CMAKE      ?= cmake
+
+.PHONY: all build test run asan m32 clean
+
+all: build
+
+$(BUILD)/CMakeCache.txt:
+	$(CMAKE) -S . -B $(BUILD) -DCMAKE_BUILD_TYPE=RelWithDebInfo
+
+build: $(BUILD)/CMakeCache.txt
+	$(CMAKE) --build $(BUILD) -j $(JOBS)
+
+test: build
+	cd $(BUILD) && ctest --output-on-failure -j $(JOBS)
+
+run: build
+	$(BUILD)/fscanner_hello
+
+asan:
+	$(CMAKE) -S . -B $(ASAN_BUILD) -DCMAKE_BUILD_TYPE=Debug -DFSCANNER_BUILD_BENCH=OFF \
+	  -DCMAKE_CXX_FLAGS="-fsanitize=address,undefined -fno-omit-frame-pointer -fno-sanitize-recover=undefined" \
+	  -DCMAKE_C_FLAGS="-fsanitize=address,undefined -fno-omit-frame-pointer" \
+	  -DCMAKE_EXE_LINKER_FLAGS="-fsanitize=address,undefined" \
+	  -DCMAKE_SHARED_LINKER_FLAGS="-fsanitize=address,undefined"
+	$(CMAKE) --build $(ASAN_BUILD) -j $(JOBS)
+	cd $(ASAN_BUILD) && ASAN_OPTIONS=detect_leaks=1 UBSAN_OPTIONS=print_stacktrace=1 ctest --output-on-failure -j $(JOBS)
+
+m32:
+	$(CMAKE) -S . -B $(M32_BUILD) -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+	  -DFSCANNER_BUILD_TESTS=OFF -DFSCANNER_BUILD_BENCH=OFF \
+	  -DCMAKE_CXX_FLAGS=-m32 -DCMAKE_C_FLAGS=-m32 \
+	  -DCMAKE_EXE_LINKER_FLAGS=-m32 -DCMAKE_SHARED_LINKER_FLAGS=-m32
+	$(CMAKE) --build $(M32_BUILD) -j $(JOBS)
+	file $(M32_BUILD)/libfscanner.so* | grep -q 'ELF 32-bit'
+
+clean:
+	rm -rf $(BUILD) $(ASAN_BUILD) $(M32_BUILD)

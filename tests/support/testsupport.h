@@ -1,0 +1,58 @@
+// Helpers shared by the test suites: temporary directories and trace capture.
+#ifndef FSCANNER_TESTS_SUPPORT_TESTSUPPORT_H
+#define FSCANNER_TESTS_SUPPORT_TESTSUPPORT_H
+
+#include <string>
+#include <vector>
+
+#include "base/QvLogWrapper.h"
+
+namespace testsupport {
+
+// A fresh directory under $TMPDIR (or /tmp), removed with all its contents when
+// the object goes out of scope.
+class TempDir {
+public:
+    TempDir();
+    ~TempDir();
+    TempDir(const TempDir&) = delete;
+    TempDir& operator=(const TempDir&) = delete;
+
+    const std::string& path() const { return path_; }
+    // path() + "/" + relative
+    std::string file(const std::string& relative) const;
+    // Writes content to relative (creating parent directories); returns the full path.
+    std::string write(const std::string& relative, const std::string& content) const;
+    // Creates the directory relative with its parents; returns the full path.
+    std::string mkdirs(const std::string& relative) const;
+
+private:
+    std::string path_;
+};
+
+// Reads a whole file; empty when it cannot be read.
+std::string readFile(const std::string& path);
+bool fileExists(const std::string& path);
+// Removes a tree; permissions are restored first so unreadable fixtures go too.
+void removeTree(const std::string& path);
+
+// Captures every trace message while it lives.
+class TraceCapture {
+public:
+    explicit TraceCapture(int maxLevel = QvLogWrapper::LEVEL_MAX);
+    ~TraceCapture();
+    std::vector<QvLogWrapper::Message> messages() const;
+    // True when some captured message contains text.
+    bool contains(const std::string& text) const;
+    // Number of captured messages that contain text.
+    size_t count(const std::string& text) const;
+    // All messages joined by newlines, for failure output.
+    std::string dump() const;
+};
+
+// Runs a shell command and gives its standard output.
+std::string runCommand(const std::string& command, int* status = nullptr);
+
+}  // namespace testsupport
+
+#endif
