@@ -33,16 +33,16 @@ void appendUtf8(std::string& out, uint32_t c) {
 
 // Formats one conversion with snprintf into out.
 template <typename T>
-void formatOne(std::string& out, const std::string& spec, T value) {
+void formatOne(std::string& out, const std::string& conversion, T value) {
     char small[128];
-    int n = std::snprintf(small, sizeof small, spec.c_str(), value);
+    int n = std::snprintf(small, sizeof small, conversion.c_str(), value);
     if (n < 0) return;
     if (static_cast<size_t>(n) < sizeof small) {
         out.append(small, static_cast<size_t>(n));
         return;
     }
     std::string big(static_cast<size_t>(n) + 1, '\0');
-    std::snprintf(&big[0], big.size(), spec.c_str(), value);
+    std::snprintf(&big[0], big.size(), conversion.c_str(), value);
     out.append(big.data(), static_cast<size_t>(n));
 }
 

@@ -1,0 +1,252 @@
+#include "fscanner/fscommon/wildcard.h"
+
+#include "fscanner/fscommon/pathhelper.h"
+
+#include <cwctype>
+#include <new>
+
+namespace {
+
+const wchar_t kSeparator = PathHelper::PathSeparator;
+
+// The name-mask matcher.  The three steps of the loop are labelled as they
+// are used: read the mask (step 1), compare one character (step 2), advance
+// both (step 3).  The guards marked "end" keep the walk inside both strings
+// where the plain steps would read past the end of the text; on every other
+// input the answers are those of the steps alone.
+template <typename CharType>
+bool matchMask(const CharType* mask, const CharType* text) {
+    if (mask == nullptr || text == nullptr) return false;
+    const CharType star = CharType('*');
+    const CharType any = CharType('?');
+    const CharType* restartMask = nullptr;
+    const CharType* restartText = nullptr;
+    const CharType* m = mask;
+    const CharType* t = text;
+    CharType c;
+    CharType d;
+
+step1:
+    c = *m;
+    if (c == star) {
+        while (*m == star) ++m;
+        if (*m == 0) return true;
+        restartMask = m;
+        restartText = t;
+        c = *m;
+        if (c != any) {
+            while (*t != c) {
+                if (*t == 0) return false;
+                ++t;
+                restartText = t;
+            }
+        }
+        goto step3;
+    }
+
+step2:
+    d = *t;
+    if (c == d || c == any) goto step3;
+    if (restartMask == nullptr) return false;
+    if (m == restartMask) {
+        if (d == 0) return false;
+        ++t;
+        goto step1;
+    }
+    if (d == *restartMask) {
+        m = restartMask + 1;
+        if (d == 0) return false;
+        ++t;
+        goto step1;
+    }
+    if (*restartText == 0) return false;  // end: no later start is left
+    ++restartText;
+    t = restartText;
+    m = restartMask;
+    c = *m;
+    goto step2;
+
+step3:
+    if (*t == 0) return *m == 0;  // end: both ended together, or "?" wants one more
+    ++m;
+    ++t;
+    if (*t == 0) {
+        while (*m == star) ++m;
+        return *m == 0;
+    }
+    goto step1;
+}
+
+struct SameCase {
+    bool operator()(wchar_t a, wchar_t b) const { return a == b; }
+};
+
+struct FoldedCase {
+    bool operator()(wchar_t a, wchar_t b) const {
+        return std::towlower(static_cast<wint_t>(a)) == std::towlower(static_cast<wint_t>(b));
+    }
+};
+
+template <typename Equal>
+bool globCompare(const wchar_t* pattern, const wchar_t* text, bool prefixOk) {
+    if (pattern == nullptr || text == nullptr) return false;
+    Equal equal;
+    const wchar_t* p = pattern;
+    const wchar_t* t = text;
+    while (*t != 0 && *p != L'*') {
+        if (*p != L'?' && !equal(*p, *t)) return false;
+        ++p;
+        ++t;
+    }
+    const wchar_t* markPattern = nullptr;
+    const wchar_t* markText = nullptr;
+    while (*t != 0) {
+        if (*p == L'*') {
+            ++p;
+            if (*p == 0) return true;
+            markPattern = p;
+            markText = t + 1;
+        } else if (*p != 0 && (*p == L'?' || equal(*p, *t))) {
+            ++p;
+            ++t;
+        } else {
+            p = markPattern;
+            t = markText++;
+        }
+    }
+    while (*p == L'*') ++p;
+    return *p == 0 || prefixOk;
+}
+
+template <typename Equal>
+bool pathGlobCompare(const wchar_t* pattern, const wchar_t* text, bool recursive) {
+    if (pattern == nullptr || text == nullptr) return false;
+    Equal equal;
+    const wchar_t* p = pattern;
+    const wchar_t* t = text;
+    // Before the first "*": one by one.
+    while (*t != 0 && *p != L'*') {
+        if (*p != 0 && (*p == L'?' || equal(*p, *t))) {
+            ++p;
+            ++t;
+            continue;
+        }
+        if (*p == 0 && recursive) {
+            // The pattern names a directory above the text.
+            if (*t == kSeparator) return true;
+            if (t > text && t[-1] == kSeparator) return true;
+        }
+        return false;
+    }
+    const wchar_t* markPattern = nullptr;
+    const wchar_t* markText = nullptr;
+    while (*t != 0) {
+        if (*p == L'*') {
+            ++p;
+            if (*p == 0) return true;
+            markPattern = p;
+            markText = t + 1;
+        } else if (*p != 0 && (*p == L'?' || equal(*p, *t))) {
+            ++p;
+            ++t;
+        } else {
+            if (*p == 0 && *t == kSeparator && (recursive || t[1] == 0)) return true;
+            p = markPattern;
+            t = markText++;
+        }
+    }
+    bool skipped = false;
+    while (*p == L'*') {
+        ++p;
+        skipped = true;
+    }
+    if (*p == 0) return true;
+    if (skipped) return false;
+    if (*p != kSeparator) return false;
+    return p[1] == 0 || (p[1] == L'*' && p[2] == 0);
+}
+
+}  // namespace
+
+namespace utils {
+
+template <>
+bool matchWildcard<char>(const char* mask, const char* text) {
+    return matchMask(mask, text);
+}
+
+template <>
+bool matchWildcard<wchar_t>(const wchar_t* mask, const wchar_t* text) {
+    return matchMask(mask, text);
+}
+
+}  // namespace utils
+
+bool wildcmp(const wchar_t* pattern, const wchar_t* text, bool prefixOk) {
+    return globCompare<SameCase>(pattern, text, prefixOk);
+}
+
+bool wildcasecmp(const wchar_t* pattern, const wchar_t* text, bool prefixOk) {
+    return globCompare<FoldedCase>(pattern, text, prefixOk);
+}
+
+bool wildvccmp(const wchar_t* pattern, const wchar_t* text, bool caseSensitive) {
+    return caseSensitive ? wildcmp(pattern, text, false) : wildcasecmp(pattern, text, false);
+}
+
+bool wildpathcmp(const wchar_t* pattern, const wchar_t* text, bool recursive) {
+    return pathGlobCompare<SameCase>(pattern, text, recursive);
+}
+
+bool wildcasepathcmp(const wchar_t* pattern, const wchar_t* text, bool recursive) {
+    return pathGlobCompare<FoldedCase>(pattern, text, recursive);
+}
+
+bool wildvcpathcmp(const wchar_t* pattern, const wchar_t* text, bool recursive, bool caseSensitive) {
+    return caseSensitive ? wildpathcmp(pattern, text, recursive)
+                         : wildcasepathcmp(pattern, text, recursive);
+}
+
+bool checkWildCard(const wchar_t* text) {
+    if (text == nullptr) return false;
+    return wcschr(text, L'*') != nullptr || wcschr(text, L'?') != nullptr;
+}
+
+int wcsvccmp(const wchar_t* a, const wchar_t* b, bool caseSensitive) {
+    return caseSensitive ? wcscmp(a, b) : wcscasecmp(a, b);
+}
+
+int wcsnvccmp(const wchar_t* a, const wchar_t* b, size_t n, bool caseSensitive) {
+    return caseSensitive ? wcsncmp(a, b, n) : wcsncasecmp(a, b, n);
+}
+
+bool checkPathList(const wchar_t* path, const std::vector<PathInfo>& list, bool caseSensitive,
+                   bool onlyRecursive) {
+    if (path == nullptr || list.empty()) return false;
+    for (size_t i = 0; i < list.size(); ++i) {
+        const wchar_t* entry = list[i].getPathName();
+        if (entry == nullptr) continue;
+        if (onlyRecursive) {
+            if (!list[i].getRecursive()) continue;
+            if (wildvcpathcmp(entry, path, true, caseSensitive)) return true;
+        } else if (wildvcpathcmp(entry, path, list[i].getRecursive(), caseSensitive)) {
+            return true;
+        }
+    }
+    return false;
+}
+
+wchar_t* getPathName(const wchar_t* path, const wchar_t* name) {
+    if (path == nullptr || name == nullptr) return nullptr;
+    size_t pathLength = wcslen(path);
+    size_t nameLength = wcslen(name);
+    bool separator = pathLength > 0 && path[pathLength - 1] != kSeparator;
+    wchar_t* out = new (std::nothrow) wchar_t[pathLength + (separator ? 1 : 0) + nameLength + 1];
+    if (out == nullptr) return nullptr;
+    wmemcpy(out, path, pathLength);
+    size_t at = pathLength;
+    if (separator) out[at++] = kSeparator;
+    wmemcpy(out + at, name, nameLength);
+    out[at + nameLength] = 0;
+    return out;
+}
