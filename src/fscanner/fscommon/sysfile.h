@@ -1,0 +1,142 @@
+// Positional file interface of the record store and the result files.
+//
+// All sizes and positions are 32-bit.  Seek origins are this interface's own
+// numbers, not the platform's: SEEK_FROM_START 1, SEEK_FROM_CURRENT 2,
+// SEEK_FROM_END 3.  Objects come from SysFactory and belong to whoever asked
+// for them.  No operation traces, keeps an error code or passes errno on: the
+// bool or the byte count is the whole report.  One object serves one thread
+// at a time; exclusion between processes is the business of the locks held by
+// the owner of the file.
+#ifndef FSCANNER_FSCOMMON_SYSFILE_H
+#define FSCANNER_FSCOMMON_SYSFILE_H
+
+#include <cstdint>
+#include <cstdio>
+
+const int SEEK_FROM_START = 1;
+const int SEEK_FROM_CURRENT = 2;
+const int SEEK_FROM_END = 3;
+
+class AbstractFile {
+public:
+    virtual ~AbstractFile() {}
+    // Creates the named file anew (an existing one is replaced) and opens it
+    // for reading and writing.  False when there is no name or it fails.
+    virtual bool create() = 0;
+    // Opens an existing file for reading and writing; false when it is missing.
+    virtual bool open() = 0;
+    // Closes the file; false when none is open.  The object may be reopened.
+    virtual bool close() = 0;
+    // Copies up to length bytes into buffer at the current position; returns
+    // the bytes transferred and advances by them.
+    virtual unsigned int read(void* buffer, unsigned int length) = 0;
+    // Copies length bytes from buffer at the current position; returns the
+    // bytes transferred and advances by them.
+    virtual unsigned int write(void* buffer, unsigned int length) = 0;
+    // Moves the position; origin 1 start, 2 current, 3 end.  False for another
+    // origin or a refused target.
+    virtual bool seek(long offset, int origin) = 0;
+    virtual long tell() = 0;
+    // True after a read that reached the end of the content.
+    virtual bool eof() = 0;
+    // Stores the file's size in *result; false when it cannot be learnt.
+    virtual bool size(unsigned int* result) = 0;
+};
+
+class AbstractStdFile : public AbstractFile {};
+class AbstractMmFile : public AbstractFile {};
+
+// Buffered file on stdio.  read and write assume an open stream: calling them
+// on a closed object is the caller's error.
+class StdFile : public AbstractStdFile {
+public:
+    // Copies name (kelm_malloc); null leaves the object nameless, and then
+    // create and open fail.
+    explicit StdFile(wchar_t const* name);
+    ~StdFile() override;
+
+    bool create() override;
+    bool open() override;
+    bool close() override;
+    unsigned int read(void* buffer, unsigned int length) override;
+    unsigned int write(void* buffer, unsigned int length) override;
+    // Returns true for origins 1..3 on an open stream whatever fseek says.
+    bool seek(long offset, int origin) override;
+    long tell() override;
+    bool eof() override;
+    bool size(unsigned int* result) override;
+
+private:
+    StdFile(const StdFile&) = delete;
+    StdFile& operator=(const StdFile&) = delete;
+    bool openMode(const char* mode);
+
+    FILE* stream;
+    wchar_t* name;
+};
+
+// Memory-mapped file that grows by LinuxMmFile::CHUNK (16 MiB) at a time.
+//
+// The file on disk is extended ahead of the content ("allocated size"); the
+// content that counts is the "logical size".  close() truncates the file to
+// the logical size.  A process that dies with the file open leaves it at the
+// allocated size, zeros behind the last written byte; opening it again makes
+// the padding content.  The mapping is shared, so written bytes reach the file
+// without close().
+class LinuxMmFile : public AbstractMmFile {
+public:
+    static const uint32_t CHUNK = 0x1000000;
+
+    // Copies name (kelm_malloc); null leaves the object nameless.
+    explicit LinuxMmFile(char const* name);
+    // close(), then frees the name.
+    ~LinuxMmFile() override;
+
+    // Unlinks the name, opens it anew (0660); nothing mapped or allocated yet.
+    bool create() override;
+    // Opens an existing file and maps it; an empty file stays unmapped.  A
+    // descriptor opened here stays open when sizing or mapping fails.
+    bool open() override;
+    // Unmaps, truncates to the logical size, closes.  On a failed close the
+    // object keeps its state and returns false.
+    bool close() override;
+    // Nothing mapped: 0 and the end flag set.  A read past the logical size
+    // copies what remains and sets the flag; a full read clears it.
+    unsigned int read(void* buffer, unsigned int length) override;
+    // Grows the file (addChunk) when the write passes the logical size;
+    // returns length, or 0 when growth or mapping is missing.  No short write.
+    unsigned int write(void* buffer, unsigned int length) override;
+    // Clears the end flag always; never moves past the logical size.
+    bool seek(long offset, int origin) override;
+    long tell() override;
+    bool eof() override;
+    // Size ON DISK of the named file (the allocated size while it is open).
+    bool size(unsigned int* result) override;
+
+    // Growth step; see the .cpp for the two ways the logical size moves.
+    bool addChunk(unsigned int length);
+    // (Re)maps the file: the allocated size when that is larger than the size
+    // on disk, else the size on disk.
+    bool mapFile();
+    // msync + munmap of the allocated size, then fsync; false when unmapped.
+    bool unMapFile();
+
+    // Observers for callers that need the two sizes (tests, diagnostics).
+    uint32_t logicalSize() const { return logical; }
+    uint32_t allocatedSize() const { return allocated; }
+    bool isOpen() const { return fd != -1; }
+
+private:
+    LinuxMmFile(const LinuxMmFile&) = delete;
+    LinuxMmFile& operator=(const LinuxMmFile&) = delete;
+
+    int32_t fd;
+    uint32_t logical;
+    uint32_t allocated;
+    uint32_t position;
+    char* address;  // (char*)-1 when nothing is mapped
+    char eofFlag;
+    char* name;
+};
+
+#endif

@@ -1,0 +1,1031 @@
+#include "fscanner/fscommon/table.h"
+
+#include <unistd.h>
+
+#include <cstring>
+#include <cwchar>
+#include <string>
+
+#include "base/kelmem.h"
+#include "fscanner/fscommon/codec.h"
+#include "fscanner/fscommon/pathhelper.h"
+#include "fscanner/fscommon/sysfactory.h"
+#include "fscanner/fscommon/table_format.h"
+#include "fscanner/fscommon/utils.h"
+
+using namespace tableformat;
+
+namespace {
+
+wchar_t* wideDup(wchar_t const* text) {
+    if (text == nullptr) return nullptr;
+    size_t n = wcslen(text) + 1;
+    wchar_t* copy = static_cast<wchar_t*>(kelm_malloc(n * sizeof(wchar_t)));
+    if (copy != nullptr) std::memcpy(copy, text, n * sizeof(wchar_t));
+    return copy;
+}
+
+// a + b (+ c) in a new kelm_malloc block; null when any part is null.
+wchar_t* wideJoin(wchar_t const* a, wchar_t const* b, wchar_t const* c = L"") {
+    if (a == nullptr || b == nullptr || c == nullptr) return nullptr;
+    size_t la = wcslen(a), lb = wcslen(b), lc = wcslen(c);
+    wchar_t* out = static_cast<wchar_t*>(kelm_malloc((la + lb + lc + 1) * sizeof(wchar_t)));
+    if (out == nullptr) return nullptr;
+    std::memcpy(out, a, la * sizeof(wchar_t));
+    std::memcpy(out + la, b, lb * sizeof(wchar_t));
+    std::memcpy(out + la + lb, c, (lc + 1) * sizeof(wchar_t));
+    return out;
+}
+
+void unlinkWide(wchar_t const* path) {
+    if (path == nullptr) return;
+    char* narrow = utils::myWcsToMbsString(path);
+    if (narrow != nullptr && narrow[0] != 0) unlink(narrow);
+    delete[] narrow;
+}
+
+// Appends a name as the format stores it: byte length, then 4-byte characters.
+void putWideName(std::string* out, wchar_t const* text) {
+    uint32_t chars = text == nullptr ? 0 : static_cast<uint32_t>(wcslen(text));
+    codec::putFixed32(out, chars * kWideCharSize);
+    for (uint32_t i = 0; i < chars; ++i) codec::putFixed32(out, static_cast<uint32_t>(text[i]));
+}
+
+bool writeAll(AbstractFile* file, std::string const& bytes) {
+    if (bytes.empty()) return true;
+    return file->write(const_cast<char*>(bytes.data()), static_cast<unsigned int>(bytes.size())) ==
+           bytes.size();
+}
+
+bool readWord(AbstractFile* file, uint32_t* value) {
+    char buf[4];
+    if (file->read(buf, 4) != 4) return false;
+    *value = codec::decodeFixed32(buf);
+    return true;
+}
+
+// Reads a stored name of byteLength bytes into a new kelm_malloc wide string.
+// Null for a length that is not whole characters or runs past the file.
+wchar_t* readWideName(AbstractFile* file, uint32_t byteLength) {
+    if (byteLength % kWideCharSize != 0) return nullptr;
+    unsigned int fileSize = 0;
+    long here = file->tell();
+    if (!file->seek(0, SEEK_FROM_END)) return nullptr;
+    fileSize = static_cast<unsigned int>(file->tell());
+    file->seek(here, SEEK_FROM_START);
+    if (byteLength > fileSize - static_cast<unsigned int>(here)) return nullptr;
+    uint32_t chars = byteLength / kWideCharSize;
+    std::string raw(byteLength, '\0');
+    if (byteLength != 0 && file->read(&raw[0], byteLength) != byteLength) return nullptr;
+    wchar_t* out = static_cast<wchar_t*>(kelm_malloc((chars + 1) * sizeof(wchar_t)));
+    if (out == nullptr) return nullptr;
+    for (uint32_t i = 0; i < chars; ++i)
+        out[i] = static_cast<wchar_t>(codec::decodeFixed32(raw.data() + i * kWideCharSize));
+    out[chars] = 0;
+    return out;
+}
+
+unsigned long long integerValue(Field* field) {
+    switch (field->getType()) {
+        case FIELD_INT8: return static_cast<Int8Field*>(field)->value();
+        case FIELD_INT16: return static_cast<Int16Field*>(field)->value();
+        case FIELD_INT32: return static_cast<Int32Field*>(field)->value();
+        case FIELD_INT64: return static_cast<Int64Field*>(field)->value();
+        default: return 0;
+    }
+}
+
+size_t wideLength(wchar_t const* text) { return text == nullptr ? 0 : wcslen(text); }
+
+}  // namespace
+
+// ---- compressed integers ------------------------------------------------------
+
+int compressInt(unsigned long long value, char* buffer, int size) {
+    return codec::encodeCompressedBackward(value, buffer, size);
+}
+
+unsigned long long decompressInt(char* buffer) {
+    uint64_t value = 0;
+    codec::decodeCompressed(buffer, codec::kMaxCompressedLength, &value);
+    return value;
+}
+
+// ---- hash ---------------------------------------------------------------------
+
+int hash(wchar_t const* key, int buckets) {
+    uint32_t acc = 0;  // unsigned arithmetic wraps as the signed accumulator does
+    if (key != nullptr) {
+        size_t i = 0;
+        do {
+            acc = acc * 37u + static_cast<uint32_t>(key[i]);
+        } while (key[i++] != 0);
+    }
+    int32_t signedAcc = static_cast<int32_t>(acc);
+    int r = signedAcc % buckets;
+    if (r < 0) r += buckets;
+    return r;
+}
+
+int hash(unsigned int value, int buckets) {
+    int32_t v = static_cast<int32_t>(value);
+    int r = v % buckets;
+    if (r < 0) r += buckets;
+    return r;
+}
+
+// ---- Index --------------------------------------------------------------------
+
+Index::Index(wchar_t const* idxName, wchar_t const* dir, wchar_t const* fldName)
+    : file(nullptr), indexName(nullptr), fieldName(nullptr), indexFileName(nullptr), fullPath(nullptr) {
+    if (idxName == nullptr || dir == nullptr || fldName == nullptr) return;
+    indexName = wideDup(idxName);
+    fieldName = wideDup(fldName);
+    indexFileName = wideJoin(idxName, L".idx");
+    size_t dl = wcslen(dir);
+    bool hasSeparator = dl > 0 && dir[dl - 1] == L'/';
+    fullPath = wideJoin(dir, hasSeparator ? L"" : L"/", indexFileName != nullptr ? indexFileName : nullptr);
+    if (indexName == nullptr || fieldName == nullptr || indexFileName == nullptr || fullPath == nullptr) {
+        kelm_free(indexName);
+        kelm_free(fieldName);
+        kelm_free(indexFileName);
+        kelm_free(fullPath);
+        indexName = fieldName = indexFileName = fullPath = nullptr;
+    }
+}
+
+Index::Index(const Index& other)
+    : file(nullptr),
+      indexName(wideDup(other.indexName)),
+      fieldName(wideDup(other.fieldName)),
+      indexFileName(wideDup(other.indexFileName)),
+      fullPath(wideDup(other.fullPath)) {}
+
+Index::~Index() {
+    close();
+    kelm_free(indexName);
+    kelm_free(fieldName);
+    kelm_free(indexFileName);
+    kelm_free(fullPath);
+}
+
+bool Index::create() {
+    if (fullPath == nullptr || file != nullptr) return false;
+    file = SysFactory::createMmFile(fullPath);
+    if (file == nullptr) return false;
+    if (!file->create()) {
+        delete file;
+        file = nullptr;
+        return false;
+    }
+    return init();
+}
+
+bool Index::init() {
+    if (file == nullptr) return false;
+    std::string slots(static_cast<size_t>(BUCKETS) * 8, static_cast<char>(0xFF));
+    if (!file->seek(0, SEEK_FROM_START)) return false;
+    return writeAll(file, slots);
+}
+
+bool Index::open() {
+    if (fullPath == nullptr || file != nullptr) return false;
+    file = SysFactory::createMmFile(fullPath);
+    if (file == nullptr) return false;
+    if (!file->open()) {
+        delete file;
+        file = nullptr;
+        return false;
+    }
+    return true;
+}
+
+bool Index::close() {
+    if (file == nullptr) return false;
+    file->close();
+    delete file;
+    file = nullptr;
+    return true;
+}
+
+bool Index::erase() {
+    if (fullPath == nullptr || file != nullptr) return false;
+    return removeFile(fullPath) == 0;
+}
+
+bool Index::read(unsigned int slot, unsigned int* id, unsigned int* next) {
+    if (file == nullptr) return false;
+    if (!file->seek(static_cast<long>(static_cast<unsigned long long>(slot) * 8), SEEK_FROM_START)) return false;
+    uint32_t a, b;
+    if (!readWord(file, &a) || !readWord(file, &b)) return false;
+    *id = a;
+    *next = b;
+    return true;
+}
+
+bool Index::write(unsigned int bucket, unsigned int id) {
+    if (file == nullptr) return false;
+    unsigned int headId, headNext;
+    if (!read(bucket, &headId, &headNext)) return false;
+    std::string word;
+    if (headId == EMPTY) {
+        file->seek(static_cast<long>(bucket) * 8, SEEK_FROM_START);
+        codec::putFixed32(&word, id);
+        return writeAll(file, word);
+    }
+    if (!file->seek(0, SEEK_FROM_END)) return false;
+    uint32_t newSlot = static_cast<uint32_t>(file->tell() / 8);
+    std::string moved;
+    codec::putFixed32(&moved, headId);
+    codec::putFixed32(&moved, headNext);
+    if (!writeAll(file, moved)) return false;
+    file->seek(static_cast<long>(bucket) * 8, SEEK_FROM_START);
+    codec::putFixed32(&word, id);
+    codec::putFixed32(&word, newSlot);
+    return writeAll(file, word);
+}
+
+// ---- FS_Table: construction ---------------------------------------------------
+
+FS_Table::FS_Table(wchar_t const* tableName, wchar_t const* dir, bool compressedIntegers)
+    : dataFile(nullptr),
+      pointerFile(nullptr),
+      scratch(nullptr),
+      scratchCapacity(0),
+      utf8(),
+      name(nullptr),
+      dataFileName(nullptr),
+      directory(nullptr),
+      dataPath(nullptr),
+      pointerPath(nullptr),
+      indexListName(nullptr),
+      bitmapSize(0),
+      compressed(compressedIntegers),
+      schema(),
+      indexes(),
+      recordSets(),
+      mutex(nullptr) {
+    if (tableName == nullptr || dir == nullptr) return;
+    PathHelper helper;
+    wchar_t* real = helper.realPath(dir, false);
+    if (real == nullptr) return;
+    size_t rl = wcslen(real);
+    directory = wideJoin(real, (rl > 0 && real[rl - 1] == L'/') ? L"" : L"/");
+    kelm_free(real);
+    name = wideDup(tableName);
+    dataFileName = wideJoin(tableName, kDataSuffix);
+    dataPath = wideJoin(directory, dataFileName);
+    pointerPath = wideJoin(directory, tableName, kPointerSuffix);
+    indexListName = wideJoin(tableName, kIndexListSuffix);
+    wchar_t* lockName = wideJoin(tableName, kLockSuffix);
+    if (directory == nullptr || name == nullptr || dataFileName == nullptr || dataPath == nullptr ||
+        pointerPath == nullptr || indexListName == nullptr || lockName == nullptr) {
+        kelm_free(lockName);
+        freeNames();
+        return;
+    }
+    mutex = SysFactory::createMutex(lockName);
+    kelm_free(lockName);
+}
+
+void FS_Table::freeNames() {
+    kelm_free(name);
+    kelm_free(dataFileName);
+    kelm_free(directory);
+    kelm_free(dataPath);
+    kelm_free(pointerPath);
+    kelm_free(indexListName);
+    name = dataFileName = directory = dataPath = pointerPath = indexListName = nullptr;
+}
+
+FS_Table::~FS_Table() {
+    freeHashIndexList(indexes);
+    if (dataFile != nullptr) {
+        dataFile->close();
+        delete dataFile;
+        dataFile = nullptr;
+    }
+    if (pointerFile != nullptr) {
+        pointerFile->close();
+        delete pointerFile;
+        pointerFile = nullptr;
+    }
+    freeNames();
+    kelm_free(scratch);
+    if (mutex != nullptr) {
+        // Deleting the lock object closes and unlinks the lock file.
+        delete mutex;
+        mutex = nullptr;
+    }
+    // Cursors are owned by the table; their class lives with the cursor code,
+    // which is what creates and deletes them.
+    recordSets.clear();
+}
+
+wchar_t* FS_Table::indexListPath() { return wideJoin(directory, indexListName); }
+
+unsigned int FS_Table::headerSize() {
+    unsigned int size = kFixedHeaderSize;
+    for (unsigned int i = 0; i < schema.count(); ++i)
+        size += kDescriptorFixedSize + static_cast<unsigned int>(wideLength(schema.at(i)->getName())) * kWideCharSize;
+    return size;
+}
+
+void FS_Table::setBit(unsigned int index, unsigned char* buffer) {
+    buffer[index / 8] |= static_cast<unsigned char>(0x80u >> (index % 8));
+}
+
+bool FS_Table::checkBit(unsigned int index, unsigned char const* buffer) {
+    return (buffer[index / 8] & (0x80u >> (index % 8))) != 0;
+}
+
+bool FS_Table::growScratch(unsigned int characters) {
+    if (characters <= scratchCapacity) return true;
+    wchar_t* grown = static_cast<wchar_t*>(kelm_realloc(scratch, characters * sizeof(wchar_t)));
+    if (grown == nullptr) return false;
+    scratch = grown;
+    scratchCapacity = characters;
+    return true;
+}
+
+// ---- FS_Table: lifecycle ------------------------------------------------------
+
+bool FS_Table::addField(wchar_t const* fieldName, unsigned int type) {
+    if (dataFile != nullptr || pointerFile != nullptr) return false;
+    return schema.add(fieldName, type);
+}
+
+bool FS_Table::create() {
+    if (dataPath == nullptr || pointerPath == nullptr) return false;
+    if (dataFile != nullptr || pointerFile != nullptr) return false;
+    if (schema.count() > kMaxFields) return false;  // the presence bitmap holds 256 bits
+    dataFile = SysFactory::createMmFile(dataPath);
+    pointerFile = SysFactory::createMmFile(pointerPath);
+    if (dataFile == nullptr || pointerFile == nullptr || !dataFile->create() || !pointerFile->create()) {
+        delete dataFile;
+        delete pointerFile;
+        dataFile = pointerFile = nullptr;
+        return false;
+    }
+    std::string header;
+    codec::putFixed32(&header, 0);  // stored count
+    codec::putFixed32(&header, 0);  // deleted count
+    codec::putFixed32(&header, schema.count());
+    for (unsigned int i = 0; i < schema.count(); ++i) {
+        codec::putFixed32(&header, schema.at(i)->getType());
+        putWideName(&header, schema.at(i)->getName());
+    }
+    if (!writeAll(dataFile, header)) {
+        close();
+        return false;
+    }
+    bitmapSize = bitmapBytes(schema.count());
+    // A new table has no indexes; index files of an earlier table stay.
+    wchar_t* listPath = indexListPath();
+    unlinkWide(listPath);
+    kelm_free(listPath);
+    return true;
+}
+
+bool FS_Table::open() {
+    if (dataPath == nullptr || pointerPath == nullptr) return false;
+    if (dataFile != nullptr || pointerFile != nullptr) return false;
+    dataFile = SysFactory::createMmFile(dataPath);
+    pointerFile = SysFactory::createMmFile(pointerPath);
+    if (dataFile == nullptr || pointerFile == nullptr || !dataFile->open() || !pointerFile->open()) {
+        if (dataFile != nullptr) dataFile->close();
+        if (pointerFile != nullptr) pointerFile->close();
+        delete dataFile;
+        delete pointerFile;
+        dataFile = pointerFile = nullptr;
+        return false;
+    }
+    // The header is trusted as to its values; what is checked is only that it
+    // lies inside the file, so a truncated or foreign file fails cleanly.
+    uint32_t stored, deleted, fieldCount;
+    bool ok = readWord(dataFile, &stored) && readWord(dataFile, &deleted) && readWord(dataFile, &fieldCount) &&
+              fieldCount <= kMaxFields;
+    for (uint32_t i = 0; ok && i < fieldCount; ++i) {
+        uint32_t type, nameBytes;
+        ok = readWord(dataFile, &type) && readWord(dataFile, &nameBytes);
+        if (!ok) break;
+        wchar_t* fieldName = readWideName(dataFile, nameBytes);
+        if (fieldName == nullptr) {
+            ok = false;
+            break;
+        }
+        schema.add(fieldName, type);
+        kelm_free(fieldName);
+    }
+    if (!ok) {
+        close();
+        return false;
+    }
+    retrieveHashIndexList(indexes);
+    recordSets.clear();
+    bitmapSize = bitmapBytes(fieldCount);
+    return true;
+}
+
+bool FS_Table::close() {
+    if (dataFile != nullptr) {
+        dataFile->close();
+        delete dataFile;
+        dataFile = nullptr;
+    }
+    if (pointerFile != nullptr) {
+        pointerFile->close();
+        delete pointerFile;
+        pointerFile = nullptr;
+    }
+    freeHashIndexList(indexes);
+    recordSets.clear();
+    schema.removeAll();
+    return true;
+}
+
+bool FS_Table::erase() {
+    if (dataFile != nullptr || pointerFile != nullptr) return false;
+    if (dataPath == nullptr || pointerPath == nullptr) return false;
+    unlinkWide(dataPath);
+    unlinkWide(pointerPath);
+    // The list is read without the table being open.
+    std::vector<Index*> list;
+    retrieveHashIndexList(list);
+    for (Index* index : list) {
+        index->close();
+        index->erase();
+    }
+    freeHashIndexList(list);
+    eraseHashIndexList(list);
+    return true;
+}
+
+// ---- FS_Table: records --------------------------------------------------------
+
+bool FS_Table::writeValue(Field* field) {
+    std::string bytes;
+    switch (field->getType()) {
+        case FIELD_INT8:
+            bytes.push_back(static_cast<char>(static_cast<Int8Field*>(field)->value()));
+            break;
+        case FIELD_INT16:
+        case FIELD_INT32:
+        case FIELD_INT64: {
+            unsigned long long v = integerValue(field);
+            if (compressed) {
+                codec::putCompressed(&bytes, v);
+            } else if (field->getType() == FIELD_INT16) {
+                codec::putFixed16(&bytes, static_cast<uint16_t>(v));
+            } else if (field->getType() == FIELD_INT32) {
+                codec::putFixed32(&bytes, static_cast<uint32_t>(v));
+            } else {
+                codec::putFixed64(&bytes, v);
+            }
+            break;
+        }
+        case FIELD_TEXT: {
+            wchar_t const* text = static_cast<TextField*>(field)->value();
+            size_t length = 0;
+            if (text != nullptr && utils::stringToUTF8(utf8, text) > 0 && utf8.get() != nullptr)
+                length = strlen(reinterpret_cast<char*>(utf8.get()));
+            const char* raw = length != 0 ? reinterpret_cast<char*>(utf8.get()) : "";
+            if (compressed)
+                codec::putPrefixedCompressed(&bytes, raw, length);
+            else
+                codec::putPrefixed16(&bytes, raw, length);
+            break;
+        }
+        default:
+            return true;  // type 6 is never stored
+    }
+    return writeAll(dataFile, bytes);
+}
+
+bool FS_Table::insert(Fields& record) {
+    if (dataFile == nullptr || pointerFile == nullptr) return false;
+    if (record.count() > kMaxFields) return false;  // the bitmap buffer holds 256 bits
+    if (!dataFile->seek(0, SEEK_FROM_END) || !pointerFile->seek(0, SEEK_FROM_END)) return false;
+    uint32_t offset = static_cast<uint32_t>(dataFile->tell());
+    unsigned int id = static_cast<unsigned int>(pointerFile->tell() / kSlotSize);
+    std::string slot;
+    codec::putFixed32(&slot, offset);
+    // The slot goes first: a crash between the two writes leaves a slot on a
+    // partial record, never a record without a slot.
+    if (!writeAll(pointerFile, slot)) return false;
+    unsigned char bitmap[kBitmapBufferSize];
+    std::memset(bitmap, 0, sizeof bitmap);
+    for (unsigned int i = 0; i < record.count(); ++i)
+        if (record.at(i)->isNull()) setBit(i, bitmap);
+    std::string bits(reinterpret_cast<char*>(bitmap), bitmapSize <= kBitmapBufferSize ? bitmapSize : 0);
+    if (!writeAll(dataFile, bits)) return false;
+    for (unsigned int i = 0; i < record.count(); ++i) {
+        if (!writeValue(record.at(i))) return false;
+    }
+    bool counted = incCount(0);
+    bool indexed = hashIndexesUpdate(record, id);
+    return counted && indexed;
+}
+
+bool FS_Table::readSlot(unsigned int id, uint32_t* offset) {
+    unsigned long long position = static_cast<unsigned long long>(id) * kSlotSize;
+    if (position > 0x7FFFFFFFull) return false;
+    if (!pointerFile->seek(static_cast<long>(position), SEEK_FROM_START)) return false;
+    return readWord(pointerFile, offset);
+}
+
+bool FS_Table::readValue(Field* field) {
+    switch (field->getType()) {
+        case FIELD_INT8: {
+            unsigned char b;
+            if (dataFile->read(&b, 1) != 1) return false;
+            static_cast<Int8Field*>(field)->value(b);
+            return true;
+        }
+        case FIELD_INT16:
+        case FIELD_INT32:
+        case FIELD_INT64: {
+            unsigned long long v = 0;
+            if (compressed) {
+                char buf[codec::kMaxCompressedLength];
+                int n = 0;
+                // Byte by byte until the continuation bit is clear.
+                for (;;) {
+                    if (n == codec::kMaxCompressedLength) return false;
+                    if (dataFile->read(buf + n, 1) != 1) return false;
+                    if ((buf[n++] & 1) == 0) break;
+                }
+                v = decompressInt(buf);
+            } else if (field->getType() == FIELD_INT16) {
+                char buf[2];
+                if (dataFile->read(buf, 2) != 2) return false;
+                v = codec::decodeFixed16(buf);
+            } else if (field->getType() == FIELD_INT32) {
+                char buf[4];
+                if (dataFile->read(buf, 4) != 4) return false;
+                v = codec::decodeFixed32(buf);
+            } else {
+                char buf[8];
+                if (dataFile->read(buf, 8) != 8) return false;
+                v = codec::decodeFixed64(buf);
+            }
+            switch (field->getType()) {
+                case FIELD_INT16: static_cast<Int16Field*>(field)->value(static_cast<unsigned short>(v)); break;
+                case FIELD_INT32: static_cast<Int32Field*>(field)->value(static_cast<unsigned int>(v)); break;
+                default: static_cast<Int64Field*>(field)->value(v); break;
+            }
+            return true;
+        }
+        case FIELD_TEXT: {
+            uint32_t length = 0;
+            if (compressed) {
+                char buf[codec::kMaxCompressedLength];
+                int n = 0;
+                for (;;) {
+                    if (n == codec::kMaxCompressedLength) return false;
+                    if (dataFile->read(buf + n, 1) != 1) return false;
+                    if ((buf[n++] & 1) == 0) break;
+                }
+                unsigned long long v = decompressInt(buf);
+                if (v > 0xFFFFull) return false;  // never written by this table
+                length = static_cast<uint32_t>(v);
+            } else {
+                char buf[2];
+                if (dataFile->read(buf, 2) != 2) return false;
+                length = codec::decodeFixed16(buf);
+            }
+            // Padding of zeros behind the text keeps the lenient UTF-8 decoder
+            // inside the block whatever the bytes say.
+            const unsigned int pad = 8;
+            unsigned char local[kInlineTextBytes + 1 + 8];
+            unsigned char* bytes = local;
+            if (length > kInlineTextBytes) {
+                bytes = static_cast<unsigned char*>(kelm_malloc(length + 1 + pad));
+                if (bytes == nullptr) return false;
+            }
+            std::memset(bytes, 0, (length > kInlineTextBytes ? length : kInlineTextBytes) + 1 + pad);
+            bool ok = length == 0 || dataFile->read(bytes, length) == length;
+            if (ok) ok = growScratch(length + 1);
+            if (ok) {
+                utils::utf8ToWideChar(scratch, scratchCapacity, bytes);
+                static_cast<TextField*>(field)->value(scratch);
+            }
+            if (bytes != local) kelm_free(bytes);
+            return ok;
+        }
+        default:
+            return false;  // type 6 is never stored, so it cannot be read back
+    }
+}
+
+bool FS_Table::read(unsigned int id, Fields& record) {
+    // A closed table answers true and leaves record alone: callers rely on it.
+    if (dataFile == nullptr || pointerFile == nullptr) return true;
+    uint32_t offset;
+    if (!readSlot(id, &offset)) return false;
+    // A removed slot (0) reads the data header as a record; callers walk with
+    // the move operations, which never stop on one.
+    if (!dataFile->seek(static_cast<long>(offset), SEEK_FROM_START)) return false;
+    unsigned char bitmap[kBitmapBufferSize];
+    std::memset(bitmap, 0, sizeof bitmap);
+    unsigned int bits = bitmapSize <= kBitmapBufferSize ? bitmapSize : kBitmapBufferSize;
+    if (bits != 0 && dataFile->read(bitmap, bits) != bits) return false;
+    if (record.count() == 0) return true;
+    for (unsigned int i = 0; i < record.count(); ++i) {
+        Field* field = record.at(i);
+        // Storing the value clears the flag again, so readers see every field
+        // as not null; the order is kept as it is.
+        field->setNull(i < kMaxFields && checkBit(i, bitmap));
+        if (!readValue(field)) return false;
+    }
+    return true;
+}
+
+bool FS_Table::update(unsigned int id, Fields& record) {
+    if (dataFile == nullptr || pointerFile == nullptr) return false;
+    if (compressed) {
+        remove(id);
+        insert(record);
+        return true;
+    }
+    Fields stored(record);
+    if (!read(id, stored)) return false;
+    uint32_t offset;
+    if (!readSlot(id, &offset) || !dataFile->seek(static_cast<long>(offset), SEEK_FROM_START)) return false;
+    if (record.count() > kMaxFields) return false;
+    unsigned char bitmap[kBitmapBufferSize];
+    std::memset(bitmap, 0, sizeof bitmap);
+    for (unsigned int i = 0; i < record.count(); ++i)
+        if (record.at(i)->isNull()) setBit(i, bitmap);
+    if (!writeAll(dataFile, std::string(reinterpret_cast<char*>(bitmap), bitmapSize))) return false;
+    for (unsigned int i = 0; i < record.count(); ++i) {
+        Field* field = record.at(i);
+        unsigned int type = field->getType();
+        if (type >= FIELD_INT8 && type <= FIELD_INT64) {
+            if (!writeValue(field)) return false;
+        } else if (type == FIELD_TEXT) {
+            wchar_t const* now = static_cast<TextField*>(field)->value();
+            wchar_t const* before = (i < stored.count() && stored.at(i)->getType() == FIELD_TEXT)
+                                        ? static_cast<TextField*>(stored.at(i))->value()
+                                        : nullptr;
+            if (wideLength(now) != wideLength(before)) {
+                // Fields before this one were overwritten already; harmless,
+                // the old record is dead from here on.
+                remove(id);
+                insert(record);
+                return true;
+            }
+            // Same character count: overwritten in place even when the UTF-8
+            // length differs.
+            if (!writeValue(field)) return false;
+        }
+    }
+    return true;
+}
+
+bool FS_Table::remove(unsigned int id) {
+    if (dataFile == nullptr || pointerFile == nullptr) return false;
+    unsigned long long position = static_cast<unsigned long long>(id) * kSlotSize;
+    if (!pointerFile->seek(0, SEEK_FROM_END)) return false;
+    // Only existing slots can be zeroed; a number past the end would grow the file.
+    if (position + kSlotSize > static_cast<unsigned long long>(pointerFile->tell())) return false;
+    if (!pointerFile->seek(static_cast<long>(position), SEEK_FROM_START)) return false;
+    std::string zero;
+    codec::putFixed32(&zero, kRemovedSlot);
+    if (!writeAll(pointerFile, zero)) return false;
+    bool dec = decCount(0);
+    bool inc = incCount(1);
+    return dec && inc;
+}
+
+// ---- FS_Table: walks ----------------------------------------------------------
+
+bool FS_Table::moveFirst(unsigned int& id) {
+    if (pointerFile == nullptr) return false;
+    uint32_t slot;
+    if (!readSlot(0, &slot)) return false;
+    if (slot != kRemovedSlot) {
+        id = 0;
+        return true;
+    }
+    unsigned int from = 0;
+    if (!moveNext(from)) return false;
+    id = from;
+    return true;
+}
+
+bool FS_Table::moveNext(unsigned int& id) {
+    if (pointerFile == nullptr) return false;
+    unsigned long long position = (static_cast<unsigned long long>(id) + 1) * kSlotSize;
+    if (position > 0x7FFFFFFFull || !pointerFile->seek(static_cast<long>(position), SEEK_FROM_START)) return false;
+    unsigned int n = id + 1;
+    uint32_t slot;
+    while (readWord(pointerFile, &slot)) {
+        if (slot != kRemovedSlot) {
+            id = n;
+            return true;
+        }
+        ++n;
+    }
+    return false;
+}
+
+bool FS_Table::movePrevious(unsigned int& id) {
+    if (pointerFile == nullptr) return false;
+    unsigned int n = id - 1;
+    unsigned long long position = static_cast<unsigned long long>(n) * kSlotSize;
+    if (position > 0x7FFFFFFFull || !pointerFile->seek(static_cast<long>(position), SEEK_FROM_START)) return false;
+    uint32_t slot;
+    // Only the first read seeks: over a removed slot the number counts down
+    // while the reads go on forward, and the walk ends at the next live slot
+    // above or at the end of the file.
+    while (readWord(pointerFile, &slot)) {
+        if (slot != kRemovedSlot) {
+            id = n;
+            return true;
+        }
+        --n;
+    }
+    return false;
+}
+
+bool FS_Table::moveLast(unsigned int& id, unsigned int& index) {
+    if (pointerFile == nullptr) return false;
+    unsigned int current = 0;
+    if (!moveFirst(current)) return false;
+    unsigned int live = 1;
+    unsigned int last = current;
+    while (moveNext(current)) {
+        last = current;
+        ++live;
+    }
+    id = last;
+    index = live - 1;
+    // The result is 0 even though a record was found; callers read id and index.
+    return false;
+}
+
+bool FS_Table::eof() {
+    if (dataFile == nullptr) return false;
+    long here = dataFile->tell();
+    dataFile->seek(0, SEEK_FROM_END);
+    long end = dataFile->tell();
+    dataFile->seek(here, SEEK_FROM_START);
+    return here == end;
+}
+
+// ---- FS_Table: counts ---------------------------------------------------------
+
+bool FS_Table::count(int which, unsigned int* result) {
+    if (which != 0 && which != 1) return false;
+    if (dataFile == nullptr) return false;
+    if (!dataFile->seek(which == 0 ? kStoredCountOffset : kDeletedCountOffset, SEEK_FROM_START)) return false;
+    uint32_t value;
+    if (!readWord(dataFile, &value)) return false;
+    *result = value;
+    return true;
+}
+
+bool FS_Table::count(int which, int delta) {
+    unsigned int value;
+    if (!count(which, &value)) return false;
+    value += static_cast<unsigned int>(delta);  // wraps without a check
+    if (!dataFile->seek(which == 0 ? kStoredCountOffset : kDeletedCountOffset, SEEK_FROM_START)) return false;
+    std::string word;
+    codec::putFixed32(&word, value);
+    return writeAll(dataFile, word);
+}
+
+bool FS_Table::incCount(int which) { return count(which, 1); }
+
+bool FS_Table::decCount(int which) { return count(which, -1); }
+
+// ---- FS_Table: lock -----------------------------------------------------------
+
+int FS_Table::lock() { return mutex == nullptr ? SYNC_FAILED : mutex->wait(); }
+
+int FS_Table::lock(long timeout) { return mutex == nullptr ? SYNC_FAILED : mutex->wait(timeout); }
+
+int FS_Table::unlock() { return mutex == nullptr ? 0 : mutex->release(); }
+
+// ---- FS_Table: index list -----------------------------------------------------
+
+bool FS_Table::hashIndexesUpdate(Fields& record, unsigned int id) {
+    for (Index* index : indexes) {
+        if (index->getFieldName() == nullptr) return false;
+        Field* field = record.name(index->getFieldName());
+        if (field == nullptr) return false;
+        if (field->isNull()) continue;
+        unsigned int type = field->getType();
+        if (type >= FIELD_INT8 && type <= FIELD_INT64) {
+            wchar_t key[24];
+            // 64-bit values are keyed by their low 32 bits.
+            wcs_itoa(static_cast<unsigned int>(integerValue(field)), key);
+            index->write(static_cast<unsigned int>(hash(key, Index::BUCKETS)), id);
+        } else if (type == FIELD_TEXT) {
+            wchar_t const* text = static_cast<TextField*>(field)->value();
+            size_t n = wideLength(text);
+            wchar_t local[256];
+            wchar_t* upper = local;
+            if (n > 255) {
+                upper = static_cast<wchar_t*>(kelm_malloc((n + 1) * sizeof(wchar_t)));
+                if (upper == nullptr) return false;
+            }
+            if (text != nullptr) std::memcpy(upper, text, (n + 1) * sizeof(wchar_t));
+            else upper[0] = 0;
+            wcsupper(upper);
+            index->write(static_cast<unsigned int>(hash(upper, Index::BUCKETS)), id);
+            if (upper != local) kelm_free(upper);
+        }
+    }
+    return true;
+}
+
+bool FS_Table::saveHashIndexList(std::vector<Index*>& list) {
+    wchar_t* path = indexListPath();
+    AbstractFile* file = SysFactory::createMmFile(path);
+    kelm_free(path);
+    if (file == nullptr) return false;
+    if (file->create()) {
+        std::string bytes;
+        for (Index* index : list) {
+            codec::putFixed32(&bytes, kIndexListTag);
+            putWideName(&bytes, index->getIndexName());
+            putWideName(&bytes, index->getFieldName());
+        }
+        writeAll(file, bytes);
+        file->close();
+    }
+    delete file;
+    return true;
+}
+
+bool FS_Table::retrieveHashIndexList(std::vector<Index*>& list) {
+    list.clear();
+    wchar_t* path = indexListPath();
+    AbstractFile* file = SysFactory::createMmFile(path);
+    kelm_free(path);
+    if (file == nullptr) return false;
+    if (file->open()) {
+        uint32_t tag, bytes;
+        while (readWord(file, &tag) && readWord(file, &bytes)) {
+            wchar_t* indexName = readWideName(file, bytes);
+            if (indexName == nullptr) break;
+            uint32_t fieldBytes;
+            wchar_t* fieldName = readWord(file, &fieldBytes) ? readWideName(file, fieldBytes) : nullptr;
+            if (fieldName == nullptr) {
+                kelm_free(indexName);
+                break;
+            }
+            if (tag == kIndexListTag) {
+                Index* index = new Index(indexName, directory, fieldName);
+                if (index->open()) list.push_back(index);
+                else delete index;
+            }
+            kelm_free(indexName);
+            kelm_free(fieldName);
+        }
+        file->close();
+    }
+    delete file;
+    return true;
+}
+
+bool FS_Table::eraseHashIndexList(std::vector<Index*>&) {
+    wchar_t* path = indexListPath();
+    if (path == nullptr) return false;
+    unlinkWide(path);
+    kelm_free(path);
+    return true;
+}
+
+void FS_Table::freeHashIndexList(std::vector<Index*>& list) {
+    for (Index* index : list) delete index;
+    list.clear();
+}
+
+Index* FS_Table::searchHashIndexForIndexName(wchar_t const* indexName, bool removeFromList) {
+    if (indexName == nullptr) return nullptr;
+    for (auto it = indexes.begin(); it != indexes.end(); ++it) {
+        if ((*it)->getIndexName() != nullptr && wcscmp((*it)->getIndexName(), indexName) == 0) {
+            Index* found = *it;
+            if (removeFromList) indexes.erase(it);
+            return found;
+        }
+    }
+    return nullptr;
+}
+
+Index* FS_Table::searchHashIndexForFieldName(wchar_t const* fieldName, bool removeFromList) {
+    if (fieldName == nullptr) return nullptr;
+    for (auto it = indexes.begin(); it != indexes.end(); ++it) {
+        if ((*it)->getFieldName() != nullptr && wcscmp((*it)->getFieldName(), fieldName) == 0) {
+            Index* found = *it;
+            if (removeFromList) indexes.erase(it);
+            return found;
+        }
+    }
+    return nullptr;
+}
+
+// ---- FS_Table: index building and lookup -------------------------------------
+
+bool FS_Table::addHashIndex(wchar_t const* indexName, wchar_t const* fieldName) {
+    if (indexName == nullptr || fieldName == nullptr) return false;
+    if (searchHashIndexForIndexName(indexName, false) != nullptr) return false;
+    if (!buildHashIndex(indexName, fieldName)) return false;
+    saveHashIndexList(indexes);
+    return true;
+}
+
+bool FS_Table::removeHashIndex(wchar_t const* indexName) {
+    Index* index = searchHashIndexForIndexName(indexName, true);
+    if (index != nullptr) {
+        index->close();
+        index->erase();
+        delete index;
+        saveHashIndexList(indexes);
+    }
+    // The result is false in every case, also after a removal.
+    return false;
+}
+
+bool FS_Table::buildHashIndex(wchar_t const* indexName, wchar_t const* fieldName) {
+    if (indexName == nullptr || fieldName == nullptr) return false;
+    if (schema.name(fieldName) == nullptr) return false;
+    Index* index = new Index(indexName, directory, fieldName);
+    if (!index->create()) {
+        delete index;
+        return false;
+    }
+    // A walk without criteria over every live record; the key is written
+    // whatever the field's null flag says, and a failed read still leaves
+    // the values read so far in the buffer.
+    Fields buffer(schema);
+    Field* field = buffer.name(fieldName);
+    unsigned int id = 0;
+    bool more = moveFirst(id);
+    while (more) {
+        read(id, buffer);
+        unsigned int type = field->getType();
+        if (type >= FIELD_INT8 && type <= FIELD_INT64) {
+            wchar_t key[24];
+            wcs_itoa(static_cast<unsigned int>(integerValue(field)), key);
+            index->write(static_cast<unsigned int>(hash(key, Index::BUCKETS)), id);
+        } else if (type == FIELD_TEXT) {
+            wchar_t const* text = static_cast<TextField*>(field)->value();
+            size_t n = wideLength(text);
+            wchar_t* upper = static_cast<wchar_t*>(kelm_malloc((n + 1) * sizeof(wchar_t)));
+            if (upper != nullptr) {
+                if (text != nullptr) std::memcpy(upper, text, (n + 1) * sizeof(wchar_t));
+                else upper[0] = 0;
+                wcsupper(upper);
+                index->write(static_cast<unsigned int>(hash(upper, Index::BUCKETS)), id);
+                kelm_free(upper);
+            }
+        } else if (type == FIELD_HEX) {
+            // The bucket is the first data byte itself, not a hash.
+            unsigned char const* v = static_cast<HexField*>(field)->value();
+            unsigned int bucket = (v != nullptr && v[0] > 0) ? v[1] : 0;
+            index->write(bucket, id);
+        }
+        more = moveNext(id);
+    }
+    indexes.push_back(index);
+    return true;
+}
+
+bool FS_Table::hashIndex_moveFirst(Index& index, wchar_t const* key, unsigned int& id, unsigned int& next) {
+    if (pointerFile == nullptr || key == nullptr) return false;
+    unsigned int headId, headNext;
+    if (!index.read(static_cast<unsigned int>(hash(key, Index::BUCKETS)), &headId, &headNext)) return false;
+    if (headId == Index::EMPTY) return false;
+    uint32_t slot;
+    if (!readSlot(headId, &slot)) return false;
+    next = headNext;
+    if (slot == kRemovedSlot) return hashIndex_moveNext(index, id, next);
+    id = headId;
+    return true;
+}
+
+bool FS_Table::hashIndex_moveNext(Index& index, unsigned int& id, unsigned int& next) {
+    if (pointerFile == nullptr) return false;
+    // A chain longer than the index file has slots is a loop in damaged data.
+    unsigned long long guard = 0;
+    while (next != Index::EMPTY) {
+        if (++guard > 0x20000000ull) return false;
+        unsigned int candidate, after;
+        if (!index.read(next, &candidate, &after)) {
+            // An unreadable slot ends the chain here rather than spinning on it.
+            return false;
+        }
+        next = after;
+        uint32_t slot;
+        if (!readSlot(candidate, &slot)) return false;
+        if (slot != kRemovedSlot) {
+            id = candidate;
+            return true;
+        }
+    }
+    return false;
+}

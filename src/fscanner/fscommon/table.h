@@ -1,0 +1,206 @@
+// One table of the record store: a schema of typed columns, an append-only
+// data file of variable-length records and a pointer file that maps a dense
+// record number to its data offset.  Layout: table_format.h.
+//
+// Deletion zeroes the record's slot; the bytes stay until compaction.  An
+// FS_Table has no internal locks and serves one thread at a time; lock() and
+// unlock() exclude other processes and are taken by the callers, never by the
+// table itself.  Operations answer by bool and write no trace.
+#ifndef FSCANNER_FSCOMMON_TABLE_H
+#define FSCANNER_FSCOMMON_TABLE_H
+
+#include <cstdint>
+#include <vector>
+
+#include "fscanner/fscommon/fields.h"
+#include "fscanner/fscommon/stringhelper.h"
+#include "fscanner/fscommon/sync.h"
+#include "fscanner/fscommon/sysfile.h"
+
+class __recordSet;
+class RecordSet;
+
+// Writes the 7-bit group encoding of value at the end of buffer[0..size) and
+// returns the index of its first byte (length = size - index).  The table
+// passes a 16-byte buffer; 0 gives index size - 1 with that byte 0x00.
+int compressInt(unsigned long long value, char* buffer, int size);
+// Value of the 7-bit group encoding at buffer (at most 10 bytes are read).
+unsigned long long decompressInt(char* buffer);
+
+// Header of an index list entry: three words, initialised 110, 0, 0.
+class RecordHeader {
+public:
+    RecordHeader() : tag(110), first(0), second(0) {}
+    RecordHeader(const RecordHeader& other) = default;
+    RecordHeader& operator=(const RecordHeader& other) = default;
+
+    uint32_t tag;
+    uint32_t first;
+    uint32_t second;
+};
+
+// Hash of a key over buckets: accumulator * 37 + character for every
+// character, terminator included (one more multiplication by 37), signed
+// 32-bit wrapping; the signed remainder, made non-negative.
+int hash(wchar_t const* key, int buckets);
+int hash(unsigned int value, int buckets);
+
+// A hash index on one column: 65536 bucket slots of (record number, next slot)
+// followed by overflow slots, in <dir><indexName>.idx.
+class Index {
+public:
+    static const uint32_t BUCKETS = 65536;
+    static const uint32_t EMPTY = 0xFFFFFFFFu;
+
+    Index(wchar_t const* indexName, wchar_t const* dir, wchar_t const* fieldName);
+    Index(const Index& other);
+    ~Index();
+
+    wchar_t const* getIndexName() const { return indexName; }
+    wchar_t const* getFieldName() const { return fieldName; }
+    wchar_t const* getIndexFileName() const { return indexFileName; }
+    wchar_t const* getIndexFullPathName() const { return fullPath; }
+
+    bool create();
+    bool init();
+    bool open();
+    bool close();
+    bool erase();
+    bool read(unsigned int slot, unsigned int* id, unsigned int* next);
+    // Puts id at the head of bucket's chain.
+    bool write(unsigned int bucket, unsigned int id);
+
+private:
+    Index& operator=(const Index&) = delete;
+
+    AbstractFile* file;
+    wchar_t* indexName;
+    wchar_t* fieldName;
+    wchar_t* indexFileName;
+    wchar_t* fullPath;
+};
+
+class FS_Table {
+public:
+    // Builds every file name (dir is resolved to a real path ending in "/")
+    // and the lock object "<name>_t_mutex"; touches no table file.  On any
+    // failure, or without a dir, all names stay null and create/open fail.
+    FS_Table(wchar_t const* name, wchar_t const* dir, bool compressed);
+    // Deletes indexes, closes both files, frees names, deletes the mutex
+    // (which unlinks the lock file) and the cursors.
+    ~FS_Table();
+
+    // False while open; otherwise adds a column to the schema.
+    bool addField(wchar_t const* name, unsigned int type);
+    // New empty data and pointer files (existing ones are replaced) with the
+    // schema in the header; removes this table's index list.
+    bool create();
+    // Opens both files, rebuilds the schema from the header and opens the
+    // listed indexes.  A header that runs past the data file fails.
+    bool open();
+    // Closes files, indexes and cursors and empties the schema.  Always safe.
+    bool close();
+    // Removes data, pointer, index and index list files; false while open.
+    bool erase();
+
+    // Appends record (its own fields decide what is written) and takes the
+    // next number; true when the count and the indexes were updated.
+    bool insert(Fields& record);
+    // Reads record id into record's fields.  TRUE, record untouched, when the
+    // table is closed.  After a read every field reports not null.  False at
+    // a field of type 6 (never stored) or when the record runs past the file.
+    bool read(unsigned int id, Fields& record);
+    // Plain table: overwrites in place unless a text changes its character
+    // count, in which case the record moves to a new number.  Compressed
+    // table: always moves.  The new number is not reported.
+    bool update(unsigned int id, Fields& record);
+    // Zeroes slot id; the data stays.
+    bool remove(unsigned int id);
+
+    bool moveFirst(unsigned int& id);
+    bool moveNext(unsigned int& id);
+    // Walks back one slot; over a removed slot it keeps reading forward while
+    // counting the number down (see the .cpp).
+    bool movePrevious(unsigned int& id);
+    // Sets id to the last live number and index to live count - 1; returns 0
+    // (false) in every case.
+    bool moveLast(unsigned int& id, unsigned int& index);
+
+    // True when the data file's position is at its end (false when closed).
+    bool eof();
+    // which 0: stored count, 1: deleted count.
+    bool count(int which, unsigned int* result);
+    bool incCount(int which);
+    bool decCount(int which);
+    bool count(int which, int delta);
+
+    // Results of the mutex (-21 without one); unlock returns release()'s.
+    int lock();
+    int lock(long timeout);
+    int unlock();
+
+    // Hash indexes.  addHashIndex builds the index over the live records and
+    // saves the list; removeHashIndex answers false even after a removal.
+    bool addHashIndex(wchar_t const* indexName, wchar_t const* fieldName);
+    bool removeHashIndex(wchar_t const* indexName);
+    bool buildHashIndex(wchar_t const* indexName, wchar_t const* fieldName);
+    // First live record of key's chain (key hashed as given: callers
+    // upper-case text); next holds the chain's continuation.
+    bool hashIndex_moveFirst(Index& index, wchar_t const* key, unsigned int& id, unsigned int& next);
+    bool hashIndex_moveNext(Index& index, unsigned int& id, unsigned int& next);
+    bool hashIndexesUpdate(Fields& record, unsigned int id);
+    bool saveHashIndexList(std::vector<Index*>& list);
+    bool retrieveHashIndexList(std::vector<Index*>& list);
+    bool eraseHashIndexList(std::vector<Index*>& list);
+    void freeHashIndexList(std::vector<Index*>& list);
+    Index* searchHashIndexForIndexName(wchar_t const* name, bool remove);
+    Index* searchHashIndexForFieldName(wchar_t const* name, bool remove);
+
+    // Observers.
+    unsigned int headerSize();
+    unsigned int getBitmapSize() const { return bitmapSize; }
+    bool isCompressed() const { return compressed; }
+    Fields& getFields() { return schema; }
+    wchar_t const* getName() const { return name; }
+    wchar_t const* getDirectory() const { return directory; }
+    wchar_t const* getDataPath() const { return dataPath; }
+    wchar_t const* getPointerPath() const { return pointerPath; }
+    wchar_t const* getIndexListName() const { return indexListName; }
+    AbstractFile* getDataFile() const { return dataFile; }
+    AbstractFile* getPointerFile() const { return pointerFile; }
+    std::vector<Index*>& getIndexes() { return indexes; }
+
+    static void setBit(unsigned int index, unsigned char* buffer);
+    static bool checkBit(unsigned int index, unsigned char const* buffer);
+
+private:
+    FS_Table(const FS_Table&) = delete;
+    FS_Table& operator=(const FS_Table&) = delete;
+
+    void freeNames();
+    bool growScratch(unsigned int characters);
+    bool readSlot(unsigned int id, uint32_t* offset);
+    bool writeValue(Field* field);
+    bool readValue(Field* field);
+    wchar_t* indexListPath();
+
+    AbstractFile* dataFile;
+    AbstractFile* pointerFile;
+    wchar_t* scratch;
+    unsigned int scratchCapacity;
+    utils::DynamicBuffer<unsigned char> utf8;
+    wchar_t* name;
+    wchar_t* dataFileName;
+    wchar_t* directory;
+    wchar_t* dataPath;
+    wchar_t* pointerPath;
+    wchar_t* indexListName;
+    unsigned int bitmapSize;
+    bool compressed;
+    Fields schema;
+    std::vector<Index*> indexes;
+    std::vector<__recordSet*> recordSets;
+    AbstractMutex* mutex;
+};
+
+#endif
