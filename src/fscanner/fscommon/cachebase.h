@@ -1,0 +1,243 @@
+// The cache engine's base: the files it owns, its validity marks and its
+// query memory.  A caller constructs FS_Cache or FS_Cache2, calls create,
+// takes the lock, runs queries, unlocks and closes.
+#ifndef FSCANNER_FSCOMMON_CACHEBASE_H
+#define FSCANNER_FSCOMMON_CACHEBASE_H
+
+#include <cstdio>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "fscanner/fs/fs_fileinfo.h"
+
+class AbstractMutex;
+class FS_Table;
+class RecordSet;
+class Fields;
+class Field;
+class CriteriaEvaluator;
+class FileHashBlackBox;
+class FsQuery;
+class FsResultSetWriter;
+class QvLogWrapper;
+
+// Options the creator hands the engine.  Only tail is set by the constructor.
+struct FsGlue {
+    FileHashBlackBox* knownHashes;   // not owned; wanted checksums or null
+    unsigned int checksumFlags;      // any of 0xe0: scans compute checksums
+    unsigned int reserved;           // copied, never read
+    bool cacheRemoteDrives;          // remote roots go through the cache too
+    unsigned int tail;               // 0, not read by the engine
+    FsGlue() : tail(0) {}
+};
+
+// One root's exclude digest, keyed by root path in FS_CacheBase.
+class ExcludeMD5 {
+public:
+    ExcludeMD5() { clear(); }
+    // True if all 16 digest bytes equal *digest; valid is not looked at.
+    bool compare(unsigned int (*digest)[4]) const;
+    // Stores the digest and sets valid; name is ignored.
+    void update(char const* name, unsigned int (*digest)[4]);
+    void clear();
+
+    std::string name;          // never filled
+    unsigned int word;         // 0
+    unsigned int digest[4];
+    unsigned int valid;        // 0 or 1
+};
+
+// The provider-name mark kept in <cache directory>/pr_hash.
+class ProviderHash {
+public:
+    explicit ProviderHash(wchar_t const* providerName);
+    ~ProviderHash();
+    ProviderHash(const ProviderHash&) = delete;
+    ProviderHash& operator=(const ProviderHash&) = delete;
+
+    // fileName = cachePath + "/pr_hash".  False on null or no memory.
+    bool setCachePath(wchar_t const* cachePath);
+    // Reads 16 bytes into digest; false with no fileName, no file or a short read.
+    bool readMd5OfProvider();
+    // Digests name like updateMd5OfProvider and compares with digest, unchanged.
+    bool compareMd5OfProvider(wchar_t const* name);
+    // Digests providerName into digest and writes the file.
+    bool updateMd5OfProvider();
+    // Writes the 16 bytes; false with no fileName, no open or a short write.
+    bool writeMd5File();
+
+    wchar_t* fileName;         // owned (kelm_malloc)
+    wchar_t* providerName;     // owned (kelm_malloc)
+    unsigned char digest[16];
+};
+
+enum {
+    FS_CACHE_CREATE = 0,
+    FS_CACHE_OPEN = 1,
+    FS_CACHE_OPEN_ALWAYS = 2
+};
+
+enum {
+    SUCCESS = 0,
+    CACHE_UNUSABLE = -40,
+    SCAN_TIMED_OUT = -41,
+    BUILD_TIMED_OUT = -42,
+    CACHE_ALREADY_OPENED = -51,
+    CACHE_LOCK_TIMED_OUT = -52,
+    CACHE_ERROR = -53
+};
+
+// A directory id at or above this (95% of the 32-bit range) refuses the cache.
+const unsigned int DIRECTORIES_INDEX_LIMIT = 0xf3333334u;
+
+class FS_CacheBase {
+public:
+    FS_CacheBase(wchar_t const* directoriesTable, wchar_t const* filesTable, wchar_t const* cachePath,
+                 bool tableFlag, bool cacheChecker, FsGlue* glue, wchar_t const* providerName);
+    // Not virtual: the class's table holds the two slots below and nothing
+    // else.  It closes nothing; close() is the caller's duty.
+    ~FS_CacheBase();
+    FS_CacheBase(const FS_CacheBase&) = delete;
+    FS_CacheBase& operator=(const FS_CacheBase&) = delete;
+
+    // Virtual slots, in this order.
+    virtual bool isFileToBeCached(FsQuery const& query, wchar_t const* name) = 0;
+    virtual void saveOrRestoreFilesOrMasksForCaching(FsQuery const& query) = 0;
+
+    // --- validity marks ---
+    // MD5 text over the included paths, the first 9 bytes of the last path's
+    // buffer after "**BREAK**" is appended to it, and the excluded paths.
+    // Empty if an included path starts with $remote::, $all:: or $other::.
+    void getMd5OfPaths(std::vector<PathInfo>& included, std::vector<PathInfo>& excluded,
+                       std::string& result);
+    bool compareMd5OfExclude(std::vector<PathInfo>& excludes, wchar_t const* root);
+    void updateMd5OfExclude(std::vector<PathInfo>& excludes, wchar_t const* root);
+    void readMd5OfExclude();
+    void writeMd5File();
+    void removeMd5FromExcludes();
+
+    // --- query driver ---
+    // The entry: -40 at once on an uninitialised, unopened or unusable cache;
+    // a -40 or -42 from the flow latches cacheUnusable.
+    int executeQueryEx(FsResultSetWriter& writer, FsQuery const& query, unsigned int timeout,
+                       unsigned int maxCacheAge);
+    int executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery const& query,
+                                unsigned int timeout, unsigned int maxCacheAge);
+
+    // --- lifecycle ---
+    // 0, CACHE_ALREADY_OPENED (-51) or CACHE_ERROR (-53); timeout is only traced.
+    int create(unsigned int timeout, int creationDisposition);
+    int lock();
+    int lock(int timeout);
+    void unlock();
+    bool close();
+    bool remove();
+    bool compact();
+    bool insideCacheUpdate();
+    void beginCacheUpdate();
+    void endCacheUpdate();
+    bool getDirectoriesIDCounter();
+    bool updateDirectoriesIDCounter();
+    void removeDirectoriesIDCounter();
+    void initObjects();
+    void deleteObjects();
+    bool createCache();
+    bool openCache();
+    void openTable(FS_Table** tableSlot, wchar_t const* name);
+    void deleteTable(FS_Table* table);
+    void removeCatSet();
+
+    // --- tables (cachetables.cpp) ---
+    // New table object with the directory (files) schema and hash indexes, on
+    // new files.  On failure the slot is null and the object is gone.
+    bool createDirectoriesTable(FS_Table** slot, wchar_t const* name);
+    bool createFilesTable(FS_Table** slot, wchar_t const* name);
+    // The shared lookup variables and the seven prepared criteria; false on
+    // the first failure, with its trace.
+    bool buildLookups();
+    void deleteLookups();
+
+    // New new[] string: directory, '/' unless it ends in one, name, suffix.
+    static wchar_t* getCacheFileName(wchar_t const* directory, wchar_t const* name,
+                                     wchar_t const* suffix);
+
+    // Fields, in this order.
+    AbstractMutex* accessMutex;
+    FILE* folderLog;
+    FS_Table* tbFiles;
+    FS_Table* tbDirectories;
+    RecordSet* filesCursor;
+    RecordSet* directoriesCursor;
+    RecordSet* directoriesCursor2;
+    wchar_t* filesTableName;
+    wchar_t* directoriesTableName;
+    wchar_t* cachePathName;
+    wchar_t* mutexName;
+    unsigned int directoriesIndex;
+    bool cacheInitialized;
+    bool cacheOpened;
+    bool cacheUnusable;
+    bool tableFlag;
+    bool cacheChecker;
+    char* narrowPathBuffer;
+    size_t narrowPathBufferSize;
+    wchar_t* wideNameBuffer;
+    size_t wideNameBufferSize;
+    Fields* defaultVariables;
+    // id, pathid, parentid, pathname, shortpathname, filename, shortfilename,
+    // md5, crc32, q32: handles into defaultVariables, not owned.
+    Field* variableHandles[10];
+    // critPathId, critParentId, critId, critPathOrShortPath, critPathName,
+    // critFileOrShortFile, critFileName.
+    CriteriaEvaluator* criteria[7];
+    std::map<std::string, ExcludeMD5> excludeMd5;
+    wchar_t* exHashFileName;
+    std::string lastMd5OfPaths;
+    ProviderHash providerHash;
+    // Query memory.
+    bool firstQuery;
+    bool pathsChanged;
+    bool fileSystemsChanged;
+    std::vector<PathInfo> prevIncludedPaths;
+    std::vector<PathInfo> prevExcludedPaths;
+    std::vector<FileSystemInfo> prevIncludedFileSystems;
+    std::vector<FileSystemInfo> prevExcludedFileSystems;
+    std::vector<DriveInfo> driveList;
+    std::vector<DriveInfo> prunedDriveList;
+    std::vector<PathInfo> drivePaths;
+    std::vector<PathInfo> prunedDrivePaths;
+    std::vector<PathInfo> droppedDrivePaths;
+    std::vector<PathDrive> includeParentResolved;
+    std::vector<PathDrive> includeResolved;
+    std::vector<PathDrive> includeExcluded;
+    std::vector<PathDrive> includeUnresolved;
+    std::vector<PathDrive> includeRoots;
+    std::vector<PathDrive> excludeParentResolved;
+    std::vector<PathDrive> excludeResolved;
+    std::vector<PathDrive> excludeExcluded;
+    std::vector<PathDrive> excludeUnresolved;
+    std::vector<PathInfo> localIncludePaths;
+    std::vector<PathInfo> localExcludePaths;
+    std::vector<PathInfo> remoteIncludePaths;
+    std::vector<PathInfo> remoteExcludePaths;
+    std::vector<PathInfo> scanExcludePaths;
+    std::vector<PathInfo> scanIncludePaths;
+    char const* className;
+    QvLogWrapper* log;
+    FileHashBlackBox* knownHashes;
+    unsigned int checksumFlags;
+    unsigned int reserved;
+    bool cacheRemoteDrives;
+    bool computeChecksums;
+    int filesScanned;
+    int directoriesScanned;
+    wchar_t* catSetFileName;
+
+private:
+    bool createTables();
+    void exclusionDigest(std::vector<PathInfo>& excludes, bool throttle, unsigned int (*digest)[4]);
+    static std::string exclusionKey(wchar_t const* root);
+};
+
+#endif
