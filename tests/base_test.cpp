@@ -220,6 +220,7 @@ TEST(Tracing, FormatterHandlesWidthsPrecisionAndPercent) {
     EXPECT_EQ(QvLogWrapper::format("%5d|%-3s|%.2f|%%|%llu|%lx", 42, "a", 1.005, 18446744073709551615ULL,
                                    255UL),
               "   42|a  |1.00|%|18446744073709551615|ff");
-    EXPECT_EQ(QvLogWrapper::format("%S", static_cast<const wchar_t*>(nullptr)), "(null)");
+    const wchar_t* volatile none = nullptr;
+    EXPECT_EQ(QvLogWrapper::format("%S", none), "(null)");
     EXPECT_EQ(QvLogWrapper::format("%0.1f%%", 50.0), "50.0%");
 }

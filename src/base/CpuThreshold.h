@@ -17,11 +17,11 @@
 class CpuThreshold {
 public:
     // Scans call doIteration() once per this many files.
-    static const int CPU_THROTTLE_NO_OF_SCANNED_FILES_FACTOR = 64;
+    static constexpr int CPU_THROTTLE_NO_OF_SCANNED_FILES_FACTOR = 64;
     // Loops over long lists call doIteration() once per this many turns.
-    static const int CPU_THROTTLE_ITERATION_FACTOR_NORMAL = 100;
+    static constexpr int CPU_THROTTLE_ITERATION_FACTOR_NORMAL = 100;
     // Loops over short lists call doIteration() once per this many turns.
-    static const int CPU_THROTTLE_ITERATION_FACTOR_SMALL = 10;
+    static constexpr int CPU_THROTTLE_ITERATION_FACTOR_SMALL = 10;
 
     static void Initialize(const char* threshold);
     static void doIteration();

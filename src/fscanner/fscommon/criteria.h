@@ -105,7 +105,7 @@ private:
     // Open parentheses and negations; past MAX_DEPTH the text is refused
     // rather than recursing without bound.
     unsigned int depth;
-    static const unsigned int MAX_DEPTH = 1000;
+    static constexpr unsigned int MAX_DEPTH = 1000;
 };
 
 #endif

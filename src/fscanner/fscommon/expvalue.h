@@ -29,7 +29,7 @@ const unsigned int EXP_MAX_STRING = 4194303;
 class ExpValue {
 public:
     // Texts of up to INLINE_CHARS - 1 characters stay in the object.
-    static const unsigned int INLINE_CHARS = 128;
+    static constexpr unsigned int INLINE_CHARS = 128;
 
     // The empty value: numeric 0, empty text, no name, no flags, no set.
     ExpValue();
@@ -116,7 +116,7 @@ public:
 
 // One entry of the command table.  The command object is not owned.
 struct CmdToken {
-    static const unsigned int MAX_NAME = 32;
+    static constexpr unsigned int MAX_NAME = 32;
 
     CmdToken() : argumentCount(0), returnType(0) {
         name[0] = L'\0';

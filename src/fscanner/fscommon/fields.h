@@ -112,7 +112,7 @@ class TextField : public Field {
 public:
     // Values of up to INLINE_CHARS - 1 characters live inline; longer ones in
     // a kelm_malloc block owned by the field.
-    static const unsigned int INLINE_CHARS = 128;
+    static constexpr unsigned int INLINE_CHARS = 128;
 
     TextField();
     explicit TextField(wchar_t const* name);

@@ -87,13 +87,13 @@ private:
 class FileMaskLookup {
 public:
     // Shape bits, also the results of insert.
-    static const unsigned char SHAPE_PLAIN = 1;
-    static const unsigned char SHAPE_LEFT = 2;   // "*tail"
-    static const unsigned char SHAPE_RIGHT = 4;  // "head*"
-    static const unsigned char SHAPE_HARD = 8;
+    static constexpr unsigned char SHAPE_PLAIN = 1;
+    static constexpr unsigned char SHAPE_LEFT = 2;   // "*tail"
+    static constexpr unsigned char SHAPE_RIGHT = 4;  // "head*"
+    static constexpr unsigned char SHAPE_HARD = 8;
     // Entries of the length block; a mask of a hashed shape with more fixed
     // characters than LENGTH_SLOTS - 1 is refused.
-    static const int LENGTH_SLOTS = 4096;
+    static constexpr int LENGTH_SLOTS = 4096;
 
     FileMaskLookup();
     ~FileMaskLookup();

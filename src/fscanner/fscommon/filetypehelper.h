@@ -62,7 +62,7 @@ private:
 // directory being read is kept whole even beyond capacity.
 class FileTypeCache {
 public:
-    static const unsigned int MIN_CAPACITY = 4096;
+    static constexpr unsigned int MIN_CAPACITY = 4096;
 
     // A capacity below MIN_CAPACITY is raised to it.
     explicit FileTypeCache(unsigned int capacity = MIN_CAPACITY);
@@ -94,9 +94,9 @@ class FileTypeChecker {
 public:
     // Size of the narrow and wide work buffers and of the single-line block;
     // no line of `file` output or of a list file is read beyond it.
-    static const unsigned int BUFFER_SIZE = 8192;
+    static constexpr unsigned int BUFFER_SIZE = 8192;
     // Longest path, in characters, that getFileTypeEx and getFileTypeEx_2 take.
-    static const unsigned int MAX_PATH_CHARS = 4095;
+    static constexpr unsigned int MAX_PATH_CHARS = 4095;
 
     // The three command texts, as printf formats of one narrow string.  The
     // blanks are irregular and stay so.  LANG=C keeps the descriptions in

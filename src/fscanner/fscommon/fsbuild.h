@@ -138,7 +138,7 @@ public:
     static const unsigned int PROCESS_CRC32 = 0x40;
     static const unsigned int PROCESS_Q32 = 0x80;
     // What the two-argument constructor asks for: no checksum at all.
-    static const unsigned int PROCESS_DEFAULT = 0x1f;
+    static constexpr unsigned int PROCESS_DEFAULT = 0x1f;
 
     // criteria may be null: the processor then answers false for every file.
     // No known-checksum set.

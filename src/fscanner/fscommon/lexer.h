@@ -66,7 +66,7 @@ const size_t LEXER_MAX_VARIABLE = 1048575;
 // owned by the token; the Lexer that made it releases it.
 class fsToken {
 public:
-    static const unsigned int INLINE_CHARS = 128;
+    static constexpr unsigned int INLINE_CHARS = 128;
 
     // An end token: type 255, number 0, empty text.
     fsToken();
@@ -106,9 +106,9 @@ public:
 class Lexer {
 public:
     // getLastError() values.
-    static const int LEX_OK = 0;
-    static const int LEX_END = 1;
-    static const int LEX_NOTHING = 2;
+    static constexpr int LEX_OK = 0;
+    static constexpr int LEX_END = 1;
+    static constexpr int LEX_NOTHING = 2;
 
     // No expression: nextToken gives type 255 with error 2.
     Lexer();

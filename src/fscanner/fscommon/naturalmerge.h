@@ -45,8 +45,8 @@ public:
     typedef void (*FreeCallback)(void* record);
 
     // Values of sort()'s order.
-    static const unsigned int ORDER_ASCENDING = 1;
-    static const unsigned int ORDER_DESCENDING = 2;
+    static constexpr unsigned int ORDER_ASCENDING = 1;
+    static constexpr unsigned int ORDER_DESCENDING = 2;
 
     // Stores the callbacks.  If any of them is null, all are set to null and
     // every later sort() returns false.

@@ -90,7 +90,7 @@ public:
     // Nesting of factors (parentheses, unary operators, command arguments)
     // allowed before an expression is refused, so that the recursion can't
     // exhaust the stack.
-    static const unsigned int MAX_NESTING = 100;
+    static constexpr unsigned int MAX_NESTING = 100;
 
     // Empties the process-wide command table.
     SyntaxAnalyzer();
