@@ -165,10 +165,13 @@ TEST(CpuThresholdTest, HalfShareHoldsForABusyLoop) {
         CpuThreshold::doIteration();
     }
     double wall = now(CLOCK_MONOTONIC) - wall0, cpu = now(CLOCK_PROCESS_CPUTIME_ID) - cpu0;
-    EXPECT_GT(CpuThreshold::sleptMilliseconds(), 0u);
+    unsigned long long slept = CpuThreshold::sleptMilliseconds();
     CpuThreshold::Initialize(nullptr);
-    EXPECT_LT(cpu / wall, 0.75) << "cpu " << cpu << " wall " << wall;
-    EXPECT_GT(cpu / wall, 0.25) << "cpu " << cpu << " wall " << wall;
+    // The throttle bounds the share from above.  A loaded machine may give
+    // the loop less than its share, in which case there is nothing to sleep
+    // for, so neither a lower bound nor a sleep is certain; but a share above
+    // the limit can only come from sleeping too little.
+    EXPECT_LT(cpu / wall, 0.75) << "cpu " << cpu << " wall " << wall << " slept " << slept;
 }
 
 TEST(CpuThresholdTest, OffMeansNoSleep) {

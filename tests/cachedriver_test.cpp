@@ -124,10 +124,8 @@ TEST_F(DriverTest, UnreachableRemoteRootStillSucceeds)
     c.close();
 }
 
-TEST_F(DriverTest, LocalRootIsLeftAloneForNow)
+TEST_F(DriverTest, LocalRootTakesTheLocalBranchNotTheDirectWalk)
 {
-    // Local roots are served by the cache build, which this object does not
-    // perform yet: the root is traced and skipped.
     FS_Cache c(L"dirs", L"files", widen(cacheDir.path()).c_str(), false, true, &glue, L"prov");
     ASSERT_EQ(0, c.create(0, FS_CACHE_CREATE));
     FsQuery q;
@@ -136,9 +134,10 @@ TEST_F(DriverTest, LocalRootIsLeftAloneForNow)
     RecordingWriter w;
     testsupport::TraceCapture cap;
     EXPECT_EQ(0, c.executeQueryEx(w, q, 10000, 60));
-    EXPECT_TRUE(w.paths.empty());
     EXPECT_FALSE(cap.contains("scanning [mdRemoteDriveGroup]"));
-    EXPECT_TRUE(cap.contains("left alone: cache build not available"));
+    EXPECT_TRUE(cap.contains("FS_Cache::executeQueryCacheOnlyEx - scanning [mdLocalDriveGroup] ["));
+    EXPECT_TRUE(cap.contains("IMPORTANT: File system access on '"));
+    EXPECT_TRUE(cap.contains("FS_Cache::executeQueryCacheOnlyEx - exit. [retValue is 0]"));
     c.close();
 }
 

@@ -1,5 +1,8 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
+#include <cwchar>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -7,6 +10,7 @@
 #include "fscanner/fscommon/cachetables.h"
 #include "fscanner/fscommon/criteria.h"
 #include "fscanner/fscommon/fields.h"
+#include "fscanner/fscommon/recordset.h"
 #include "fscanner/fscommon/sync.h"
 #include "fscanner/fscommon/table.h"
 #include "support/testsupport.h"
@@ -116,4 +120,277 @@ TEST_F(TablesTest, CreateTableWithoutNameFailsAndClearsSlot)
     slot = reinterpret_cast<FS_Table*>(1);
     EXPECT_FALSE(c.createDirectoriesTable(&slot, nullptr));
     EXPECT_EQ(nullptr, slot);
+}
+
+// ------------------------------------------------------------------ lookups
+
+namespace {
+
+struct LookupTest : TablesTest {
+    std::unique_ptr<FS_Cache> cache;
+    RecordSet first;
+    RecordSet second;
+    LookupTest() {
+        cache.reset(new FS_Cache(L"dirs", L"files", widen(dir.path()).c_str(), false, true, &glue,
+                                 L"prov"));
+        EXPECT_EQ(0, cache->create(0, FS_CACHE_CREATE));
+        first = cache->tbDirectories->openRecordSet();
+        second = cache->tbDirectories->openRecordSet();
+    }
+    ~LookupTest() override { cache->close(); }
+    void addDir(unsigned int id, const wchar_t* name, unsigned int parent, unsigned int created = 1) {
+        RecordSet rs = cache->tbDirectories->openRecordSet();
+        rs.setFieldAsInt32(L"ID", id);
+        rs.setFieldAsString(L"PATHNAME", name);
+        rs.setFieldAsInt32(L"PARENTID", parent);
+        rs.setFieldAsInt32(L"CREATIONTIME", created);
+        ASSERT_TRUE(rs.insert());
+        cache->tbDirectories->closeRecordSet(rs);
+    }
+    void addFile(const wchar_t* name, unsigned int pathId) {
+        RecordSet rs = cache->tbFiles->openRecordSet();
+        rs.setFieldAsString(L"FILENAME", name);
+        rs.setFieldAsInt32(L"ATTR", 0);
+        rs.setFieldAsInt64(L"SIZE", 1);
+        rs.setFieldAsInt32(L"PATHID", pathId);
+        rs.setFieldAsString(L"MD5", L"0");
+        rs.setFieldAsInt32(L"CRC32", 0);
+        rs.setFieldAsInt32(L"Q32", 0);
+        ASSERT_TRUE(rs.insert());
+        cache->tbFiles->closeRecordSet(rs);
+    }
+    // Ids of all live rows of a table, through a plain walk.
+    std::vector<unsigned int> column(FS_Table* table, const wchar_t* name) {
+        std::vector<unsigned int> out;
+        RecordSet rs = table->openRecordSet();
+        for (bool row = rs.moveFirst(); row; row = rs.moveNext())
+            out.push_back(rs.getFieldAsInt32(name));
+        table->closeRecordSet(rs);
+        std::sort(out.begin(), out.end());
+        return out;
+    }
+    bool byName(const wchar_t* path, bool caseSensitive) {
+        std::vector<wchar_t> copy(path, path + wcslen(path) + 1);
+        return cache->findPathByName(first, second, copy.data(), caseSensitive);
+    }
+    std::wstring byId(unsigned int id, unsigned int size = 4096) {
+        std::vector<wchar_t> buffer(size + 1, L'#');
+        if (!cache->findPathById(first, id, buffer.data(), size))
+            return L"<false:" + std::wstring(buffer.data()) + L">";
+        return buffer.data();
+    }
+    // /(1) usr(2) bin(3) lib(4); opt(5) under /, bin(6) under opt.
+    void standardTree() {
+        addDir(1, L"/", 0);
+        addDir(6, L"bin", 5);
+        addDir(2, L"usr", 1);
+        addDir(3, L"bin", 2);
+        addDir(4, L"lib", 2);
+        addDir(5, L"opt", 1);
+    }
+};
+
+}  // namespace
+
+TEST_F(LookupTest, RootIsFoundAsTheSlashRowWithParentZero)
+{
+    addDir(7, L"/", 9);  // a "/" that is not at the top is not the root
+    standardTree();
+    ASSERT_TRUE(byName(L"/", true));
+    EXPECT_EQ(1u, first.getFieldAsInt32(L"ID"));
+    EXPECT_EQ(0u, first.getFieldAsInt32(L"PARENTID"));
+}
+
+TEST_F(LookupTest, CaseInsensitiveLookupFindsMixedCaseRows)
+{
+    standardTree();
+    ASSERT_TRUE(byName(L"/USR/bin", false));
+    EXPECT_EQ(3u, first.getFieldAsInt32(L"ID"));
+    ASSERT_TRUE(byName(L"/usr/BIN", false));  // last component through the index, any case
+    EXPECT_EQ(3u, first.getFieldAsInt32(L"ID"));
+    EXPECT_FALSE(byName(L"/USR/bin", true));
+    EXPECT_FALSE(byName(L"/usr/BIN", true));
+}
+
+TEST_F(LookupTest, WrongCandidateOfTheSameNameIsRejectedAndTheNextTried)
+{
+    standardTree();
+    ASSERT_TRUE(byName(L"/usr/bin", true));
+    EXPECT_EQ(3u, first.getFieldAsInt32(L"ID"));
+    ASSERT_TRUE(byName(L"/opt/bin", true));
+    EXPECT_EQ(6u, first.getFieldAsInt32(L"ID"));
+    EXPECT_FALSE(byName(L"/srv/bin", true));
+}
+
+TEST_F(LookupTest, ChainThatDoesNotReachTheTopIsNotAMatch)
+{
+    addDir(3, L"bin", 2);
+    addDir(2, L"usr", 8);  // parent 8 does not exist
+    EXPECT_FALSE(byName(L"/usr/bin", true));
+    EXPECT_FALSE(byName(L"usr/bin", true));
+    EXPECT_FALSE(byName(L"bin", true));  // one component needs parent 0
+    addDir(9, L"top", 0);
+    EXPECT_TRUE(byName(L"top", true));
+}
+
+TEST_F(LookupTest, EmptyPathIsNotFound)
+{
+    standardTree();
+    EXPECT_FALSE(byName(L"", true));
+}
+
+TEST_F(LookupTest, PathByIdRebuildsTheFullPath)
+{
+    standardTree();
+    EXPECT_EQ(L"/usr/bin", byId(3));
+    EXPECT_EQ(L"/opt/bin", byId(6));
+    EXPECT_EQ(L"/", byId(1));
+}
+
+TEST_F(LookupTest, PathByIdZeroIsFalseWithAnEmptyBuffer)
+{
+    standardTree();
+    EXPECT_EQ(L"<false:>", byId(0));
+    EXPECT_FALSE(cache->findPathById(first, 3, nullptr, 10));
+    wchar_t one[1] = {L'#'};
+    EXPECT_FALSE(cache->findPathById(first, 3, one, 0));
+    EXPECT_EQ(L'#', one[0]);
+}
+
+TEST_F(LookupTest, PathByIdRefusesABufferTooSmallInsteadOfCutting)
+{
+    standardTree();
+    // "/usr/bin" is 8 characters; the prepend needs its length plus 4.
+    EXPECT_EQ(L"<false:>", byId(3, 10));
+    EXPECT_EQ(L"/usr/bin", byId(3, 12));
+}
+
+TEST_F(LookupTest, PathByIdFailsOnABrokenChain)
+{
+    addDir(3, L"bin", 2);  // 2 is missing
+    EXPECT_EQ(L"<false:>", byId(3));
+    EXPECT_EQ(L"<false:>", byId(42));
+}
+
+TEST_F(LookupTest, PathByIdAnswersFromTheMemoAndFlushesItWhenFull)
+{
+    standardTree();
+    ASSERT_EQ(L"/usr/bin", byId(3));
+    EXPECT_EQ(3u, cache->pathMemo.size());
+    // The rows go; the memo still knows them.
+    RecordSet rs = cache->tbDirectories->openRecordSet();
+    for (bool row = rs.moveFirst(); row; row = rs.moveNext())
+        rs.remove();
+    cache->tbDirectories->closeRecordSet(rs);
+    EXPECT_EQ(L"/usr/bin", byId(3));
+
+    // 30 more ids bring the memo to 33 entries, past 32: the next walk
+    // flushes it before it looks anything up.
+    for (unsigned int id = 100; id < 131; ++id)
+        addDir(id, (L"d" + std::to_wstring(id)).c_str(), 0);
+    for (unsigned int id = 100; id < 130; ++id)
+        ASSERT_EQ(L"d" + std::to_wstring(id), byId(id));
+    EXPECT_EQ(33u, cache->pathMemo.size());
+    EXPECT_EQ(L"d130", byId(130));
+    EXPECT_EQ(1u, cache->pathMemo.size());
+    EXPECT_EQ(L"<false:>", byId(3));  // forgotten, and the rows are gone
+}
+
+TEST_F(LookupTest, RemoveTreeTakesRowsBelowAndTheirFilesAndKeepsParents)
+{
+    standardTree();
+    addDir(7, L"share", 3);
+    addFile(L"ls", 3);
+    addFile(L"cat", 3);
+    addFile(L"deep", 7);
+    addFile(L"libc.so", 4);
+    addFile(L"top", 2);
+    addFile(L"tool", 6);
+    cache->removeTree(cache->tbDirectories, cache->tbFiles, 2);  // /usr
+    EXPECT_EQ((std::vector<unsigned int>{1, 5, 6}), column(cache->tbDirectories, L"ID"));
+    EXPECT_EQ((std::vector<unsigned int>{6}), column(cache->tbFiles, L"PATHID"));
+    EXPECT_TRUE(byName(L"/opt/bin", true));
+    EXPECT_FALSE(byName(L"/usr", true));
+}
+
+TEST_F(LookupTest, RemoveTreeOfTheTopEmptiesBothTables)
+{
+    standardTree();
+    addFile(L"a", 1);
+    addFile(L"b", 4);
+    cache->removeTree(cache->tbDirectories, cache->tbFiles, 1);
+    EXPECT_TRUE(column(cache->tbDirectories, L"ID").empty());
+    EXPECT_TRUE(column(cache->tbFiles, L"PATHID").empty());
+}
+
+TEST_F(LookupTest, RemoveFilesTakesOnlyThatDirectorysFiles)
+{
+    standardTree();
+    addFile(L"a", 3);
+    addFile(L"b", 3);
+    addFile(L"c", 4);
+    cache->removeFiles(cache->tbFiles, 3);
+    EXPECT_EQ((std::vector<unsigned int>{4}), column(cache->tbFiles, L"PATHID"));
+}
+
+TEST_F(LookupTest, PathCommandGivesTheFullPathOfARow)
+{
+    standardTree();
+    chPathCommand command(cache.get());
+    ExpValue left, right, result;
+    left.setNumericValue(3);
+    right.setString(L"ls");
+    EXPECT_EQ(0, command.execute(left, right, result));
+    EXPECT_TRUE(result.isString());
+    EXPECT_EQ(std::wstring(L"/usr/bin/ls"), result.getStringValue());
+    left.setNumericValue(1);
+    EXPECT_EQ(0, command.execute(left, right, result));
+    EXPECT_EQ(std::wstring(L"/ls"), result.getStringValue());
+}
+
+TEST_F(LookupTest, PathCommandRefusesMissingArgumentsAndBrokenChains)
+{
+    standardTree();
+    chPathCommand command(cache.get());
+    ExpValue left, right, result;
+    left.setNumericValue(3);
+    right.setString(L"");
+    testsupport::TraceCapture cap;
+    EXPECT_NE(0, command.execute(left, right, result));
+    EXPECT_TRUE(cap.contains("chPathCommand::execute - args not valid!"));
+    right.setString(L"ls");
+    left.setNumericValue(77);
+    EXPECT_NE(0, command.execute(left, right, result));
+    EXPECT_TRUE(cap.contains("chPathCommand::execute - findPathById(...) failed!"));
+}
+
+TEST_F(LookupTest, TypeCommandRefusesNonTextArguments)
+{
+    chTypeCommand command;
+    ExpValue left, right, result;
+    left.setNumericValue(1);
+    right.setString(L"text");
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(1, command.execute(left, right, result));
+    EXPECT_TRUE(cap.contains("chTypeCommand::execute - args not valid!\n"));
+}
+
+TEST_F(LookupTest, TypeCommandAsksFileAboutThePath)
+{
+    // Needs the `file` command.
+    if (testsupport::runCommand("command -v file").empty())
+        GTEST_SKIP() << "the file command is not installed";
+    dir.write("note.txt", "plain words\n");
+    chTypeCommand command;
+    ExpValue left, right, result;
+    left.setString(widen(dir.file("note.txt")).c_str());
+    right.setString(L"text");
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(0, command.execute(left, right, result));
+    EXPECT_TRUE(result.isNumeric());
+    EXPECT_EQ(1u, result.getNumber());
+    right.setString(L"ELF");
+    EXPECT_EQ(0, command.execute(left, right, result));
+    EXPECT_EQ(0u, result.getNumber());
+    EXPECT_TRUE(cap.contains("chTypeCommand::execute - exit. [retValue is 0]\n"));
 }

@@ -1,5 +1,7 @@
 #include "fscanner/fscommon/cachebase.h"
 
+#include <algorithm>
+#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <cwchar>
@@ -16,6 +18,7 @@
 #include "fscanner/fs/fs_query.h"
 #include <ctime>
 #include "fscanner/fscommon/pathhelper.h"
+#include "fscanner/fscommon/recordset.h"
 #include "fscanner/fscommon/sysfactory.h"
 #include "fscanner/fscommon/table.h"
 
@@ -244,8 +247,26 @@ void FS_CacheBase::initObjects()
     filesScanned = directoriesScanned = 0;
 }
 
+// The tables own the cursors; the object owns only the three handles.
+void FS_CacheBase::openCursors()
+{
+    dropCursors();
+    filesCursor = new RecordSet(tbFiles->openRecordSet());
+    directoriesCursor = new RecordSet(tbDirectories->openRecordSet());
+    directoriesCursor2 = new RecordSet(tbDirectories->openRecordSet());
+}
+
+void FS_CacheBase::dropCursors()
+{
+    delete filesCursor;
+    delete directoriesCursor;
+    delete directoriesCursor2;
+    filesCursor = directoriesCursor = directoriesCursor2 = nullptr;
+}
+
 void FS_CacheBase::deleteObjects()
 {
+    dropCursors();
     deleteTable(tbDirectories);
     tbDirectories = nullptr;
     deleteTable(tbFiles);
@@ -253,6 +274,7 @@ void FS_CacheBase::deleteObjects()
     kelm_free(filesTableName);
     kelm_free(directoriesTableName);
     filesTableName = directoriesTableName = nullptr;
+    clearPathMemo();
     deleteLookups();
     if (accessMutex != nullptr) {
         // Destroyed through its release operation first, so a held lock goes.
@@ -308,8 +330,9 @@ bool FS_CacheBase::createCache()
         return false;
     beginCacheUpdate();
     cacheUnusable = false;
-    // TODO(cursors): the files cursor and both directories cursors are opened
-    // here once tables hand out record sets.
+    openCursors();
+    // New tables hand out ids from 1 again: nothing remembered still holds.
+    clearPathMemo();
     directoriesIndex = 0;
     updateDirectoriesIDCounter();
     return true;
@@ -347,7 +370,7 @@ bool FS_CacheBase::openCache()
                   __func__, static_cast<int>(directoriesIndex));
     beginCacheUpdate();
     cacheUnusable = false;
-    // TODO(cursors): open the three record sets here.
+    openCursors();
     log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - cache opened!", className, __func__);
     return true;
 }
@@ -457,6 +480,8 @@ bool FS_CacheBase::close()
             tbFiles->close();
         if (tbDirectories != nullptr)
             tbDirectories->close();
+        // Closing the tables deleted the cursors behind the handles.
+        dropCursors();
         if (cacheUnusable)
             remove();
         else
@@ -825,11 +850,10 @@ int FS_CacheBase::executeQueryEx(FsResultSetWriter& writer, FsQuery const& query
 }
 
 int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery const& query,
-                                          unsigned int /*timeout*/, unsigned int /*maxCacheAge*/)
+                                          unsigned int timeout, unsigned int maxCacheAge)
 {
-    // A. Set-up.
+    // A. Set-up.  All age tests of this query use one clock reading.
     time_t now = time(nullptr);
-    (void)now;  // the age tests of the local branch use it
     CpuThreshold::Initialize(query.getCpuThreshold());
     DriveHelper driveHelper;
     PathHelper pathHelper(1);
@@ -872,9 +896,9 @@ int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery con
     // C. Change detection.
     bool firstTimeOnly = query.getFirstTimeOnly();
     if (firstTimeOnly && !firstQuery) {
-        // Such a query only reads the cache.
-        // TODO(extraction): step H is served by the cache extraction.
-        return SUCCESS;
+        // Such a query only reads the cache, with the lists of the last
+        // resolution.
+        return extractFromCache(writer, query, pathHelper, caseFlag, timeout);
     }
     std::vector<PathInfo>& included = query.getIncludedPaths();
     std::vector<PathInfo>& excluded = query.getExcludedPaths();
@@ -938,43 +962,234 @@ int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery con
         pathHelper.extractPathList(includeResolved, mdOtherDriveGroup, remoteIncludePaths);
     }
 
-    // E. Marks.  TODO(cache build): served with the local branch.
-
-    // F. Visit the roots.
-    for (size_t i = 0; i < includeParentResolved.size(); ++i) {
-        CpuThreshold::doIteration();
-        PathDrive& root = includeParentResolved[i];
-        bool remote = !cacheRemoteDrives &&
-                      (static_cast<unsigned int>(root.getDriveType()) & mdLocalDriveGroup) == 0;
-        if (!remote) {
-            // TODO(cache build): local roots are built into and served from the
-            // tables; until then they are left alone.
-            log->traceMIN(__LINE__, __FILE__, __func__,
-                          "%s::%s - local root [%S] left alone: cache build not available",
-                          className, __func__,
-                          root.getPathName() != nullptr ? root.getPathName() : L"");
-            continue;
-        }
+    // E. Marks.
+    std::string md5;
+    getMd5OfPaths(prevIncludedPaths, prevExcludedPaths, md5);
+    bool cacheValid;
+    if (!providerHash.readMd5OfProvider()) {
+        cacheValid = false;
         log->traceMID(__LINE__, __FILE__, __func__,
-                      "%s::%s - scanning [mdRemoteDriveGroup] and [mdOtherDriveGroup] [%S] path...",
-                      className, __func__, root.getPathName() != nullptr ? root.getPathName() : L"");
-        remoteExcludePaths.clear();
-        pathHelper.extractPathList(excludeResolved, mdRemoteDriveGroup, remoteExcludePaths);
-        pathHelper.extractPathList(excludeResolved, mdOtherDriveGroup, remoteExcludePaths);
-        pathHelper.buildExcludeList(driveList, root, remoteExcludePaths);
-        pathHelper.fillExclude(root, excludeResolved, remoteExcludePaths);
-        FileProcessor processor(query.getQuery(), caseFlag);
-        int rc = fs_build(writer, processor, root, remoteIncludePaths, remoteExcludePaths, caseFlag,
-                          2000000000);
-        if (rc == 2) {
-            log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - fs scanning timed out (timeout)",
-                          className, __func__);
-            return SCAN_TIMED_OUT;
+                      "%s::%s - (cacheValid check1) unable to determine previous provider, therefore cache is invalid.",
+                      className, __func__);
+    } else if (!providerHash.compareMd5OfProvider(providerHash.providerName)) {
+        cacheValid = false;
+        log->traceMID(__LINE__, __FILE__, __func__,
+                      "%s::%s - (cacheValid check1) previous provider differs, therefore cache is invalid.",
+                      className, __func__);
+    } else {
+        cacheValid = true;
+    }
+    if (!providerHash.updateMd5OfProvider())
+        log->traceMID(__LINE__, __FILE__, __func__,
+                      "%s::%s - (cacheValid check1) failed to update previous cache MD5 for future scans!",
+                      className, __func__);
+    saveOrRestoreFilesOrMasksForCaching(query);
+
+    // F. Visit the roots, unless this object saw the same paths last time:
+    // then neither the age nor the excludes are looked at again.
+    if (lastMd5OfPaths.empty() || lastMd5OfPaths != md5) {
+        time_t visitStart = time(nullptr);
+        bool anyBuilt = false;
+        for (size_t i = 0; i < includeParentResolved.size(); ++i) {
+            CpuThreshold::doIteration();
+            PathDrive& root = includeParentResolved[i];
+            wchar_t const* rootPath = root.getPathName() != nullptr ? root.getPathName() : L"";
+            bool remote = !cacheRemoteDrives &&
+                          (static_cast<unsigned int>(root.getDriveType()) & mdLocalDriveGroup) == 0;
+            if (remote) {
+                log->traceMID(__LINE__, __FILE__, __func__,
+                              "%s::%s - scanning [mdRemoteDriveGroup] and [mdOtherDriveGroup] [%S] path...",
+                              className, __func__, rootPath);
+                remoteExcludePaths.clear();
+                pathHelper.extractPathList(excludeResolved, mdRemoteDriveGroup, remoteExcludePaths);
+                pathHelper.extractPathList(excludeResolved, mdOtherDriveGroup, remoteExcludePaths);
+                pathHelper.buildExcludeList(driveList, root, remoteExcludePaths);
+                pathHelper.fillExclude(root, excludeResolved, remoteExcludePaths);
+                FileProcessor processor(query.getQuery(), caseFlag);
+                int rc = fs_build(writer, processor, root, remoteIncludePaths, remoteExcludePaths,
+                                  caseFlag, 2000000000);
+                if (rc == 2) {
+                    log->traceMIN(__LINE__, __FILE__, __func__,
+                                  "%s::%s - fs scanning timed out (timeout)", className, __func__);
+                    return SCAN_TIMED_OUT;
+                }
+                continue;
+            }
+
+            int rc = visitLocalRoot(query, root, pathHelper, caseFlag, timeout, maxCacheAge, now,
+                                    cacheValid);
+            if (rc == 2)
+                return BUILD_TIMED_OUT;
+            if (rc != -1)
+                anyBuilt = true;
         }
+
+        if (anyBuilt) {
+            long t = static_cast<long>(time(nullptr) - visitStart);
+            char summary[512];
+            if (t == 0) {
+                log->traceMIN(__LINE__, __FILE__, __func__,
+                              "IMPORTANT: BUILDING CACHE SUMMARY - %d files and %d directories scanned. Scan duration 0 seconds.",
+                              filesScanned, directoriesScanned);
+                snprintf(summary, sizeof(summary),
+                         "File system scan finished - %d files and %d directories scanned.\nScan duration 0 seconds.",
+                         filesScanned, directoriesScanned);
+            } else {
+                int rate = static_cast<int>((directoriesScanned + filesScanned) / t);
+                log->traceMIN(__LINE__, __FILE__, __func__,
+                              "IMPORTANT: BUILDING CACHE SUMMARY - %d files and %d directories scanned. Scan duration '%ld' hours '%ld' minutes '%ld' seconds. %d entries per second.",
+                              filesScanned, directoriesScanned, t / 3600, (t % 3600) / 60, t % 60,
+                              rate);
+                snprintf(summary, sizeof(summary),
+                         "File system scan finished - %d files and %d directories scanned.\nScan duration '%ld' hours '%ld' minutes '%ld' seconds. %d entries per second.",
+                         filesScanned, directoriesScanned, t / 3600, (t % 3600) / 60, t % 60, rate);
+            }
+            logString(folderLog, summary);
+        }
+        closeFolderListLogfile(&folderLog);
+        if (!md5.empty())
+            lastMd5OfPaths = md5;
     }
 
     // G.
     firstQuery = false;
-    // H. TODO(extraction): hits of local roots come from the cache here.
-    return SUCCESS;
+    // H.
+    return extractFromCache(writer, query, pathHelper, caseFlag, timeout);
+}
+
+namespace {
+// The local branch and the extraction are steps of executeQueryCacheOnlyEx;
+// their traces carry its name.
+char const driverName[] = "executeQueryCacheOnlyEx";
+}  // namespace
+
+int FS_CacheBase::visitLocalRoot(FsQuery const& query, PathDrive& root, PathHelper& pathHelper,
+                                 bool caseFlag, unsigned int timeout, unsigned int maxCacheAge,
+                                 time_t now, bool& cacheValid)
+{
+    wchar_t const* rootPath = root.getPathName() != nullptr ? root.getPathName() : L"";
+    wchar_t const* driveName = root.getDriveName() != nullptr ? root.getDriveName() : L"";
+    wchar_t const* driveFs = root.getDriveFileSystem() != nullptr ? root.getDriveFileSystem() : L"";
+    int driveType = static_cast<int>(root.getDriveType());
+    log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - scanning [mdLocalDriveGroup] [%S] path...",
+                  className, driverName, rootPath);
+
+    // findPathByName takes a writable path: give it a private copy.
+    std::vector<wchar_t> pathCopy(rootPath, rootPath + wcslen(rootPath) + 1);
+    bool found = findPathByName(*directoriesCursor, *directoriesCursor2, pathCopy.data(), caseFlag);
+
+    if (cacheValid) {
+        if (!found) {
+            cacheValid = false;
+        } else {
+            // Unsigned 32-bit arithmetic, as the table stores the time.
+            uint32_t created = directoriesCursor->getFieldAsInt32(L"CREATIONTIME");
+            uint32_t limit = static_cast<uint32_t>(now) - static_cast<uint32_t>(maxCacheAge);
+            if (created < limit)
+                cacheValid = false;
+        }
+        log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - (cacheValid check2) cache is valid: %s",
+                      className, driverName, cacheValid ? "true" : "false");
+    }
+    unsigned int rootId = found ? directoriesCursor->getFieldAsInt32(L"ID") : 0;
+
+    scanExcludePaths.clear();
+    pathHelper.extractPathList(includeExcluded, cacheRemoteDrives ? mdAllDrives : mdLocalDriveGroup,
+                               scanExcludePaths);
+    pathHelper.buildExcludeList(driveList, root, scanExcludePaths);
+    pathHelper.fillExclude(root, excludeResolved, scanExcludePaths);
+    std::sort(scanExcludePaths.begin(), scanExcludePaths.end(),
+              [](PathInfo const& a, PathInfo const& b) { return a.operator<(b); });
+
+    if (cacheValid) {
+        cacheValid = compareMd5OfExclude(scanExcludePaths, rootPath);
+        log->traceMID(__LINE__, __FILE__, __func__,
+                      "%s::%s - (cacheIsValid check3) cache is valid: %s", className, driverName,
+                      cacheValid ? "true" : "false");
+    }
+    log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - cacheIsValid for [%S]: %s.", className,
+                  driverName, rootPath, cacheValid ? "true" : "false");
+
+    if (found && cacheValid) {
+        log->traceMIN(__LINE__, __FILE__, __func__,
+                      "IMPORTANT: %s::%s - retrieving data from cache for '%S' (drive: '%S', type: %d, fs: '%S')",
+                      className, driverName, rootPath, driveName, driveType, driveFs);
+        return -1;
+    }
+    if (found) {
+        log->traceMID(__LINE__, __FILE__, __func__,
+                      "%s::%s - Existing tree for '%S' in the cache is not valid. Removing it, then recreating.",
+                      className, driverName, rootPath);
+        removeTree(tbDirectories, tbFiles, rootId);
+        log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - tree removed!", className, driverName);
+    }
+
+    // A cached root is always built recursively, whatever the query said.
+    PathDrive pathDrive(rootPath, true, static_cast<DriveInfo const&>(root));
+    log->traceMIN(__LINE__, __FILE__, __func__,
+                  "IMPORTANT: File system access on '%S' (drive: '%S', type: %d, fs: '%S')", rootPath,
+                  driveName, driveType, driveFs);
+    if (folderLog == nullptr && openFolderListLogfile(&folderLog))
+        log->traceMID(__LINE__, __FILE__, __func__,
+                      "%s::%s - Failed to open file to store scanned directories list, errno=%d",
+                      className, driverName, errno);
+
+    int rc = build(query, pathDrive, *directoriesCursor, directoriesIndex, *filesCursor,
+                   *directoriesCursor2, scanIncludePaths, scanExcludePaths, caseFlag,
+                   static_cast<int>(timeout));
+    if (folderLog != nullptr)
+        fflush(folderLog);
+
+    if (rc == 0) {
+        updateMd5OfExclude(scanExcludePaths, rootPath);
+        log->traceMIN(__LINE__, __FILE__, __func__,
+                      "IMPORTANT: (OK) File system access on '%S' (drive: '%S', type: %d, fs: '%S')",
+                      rootPath, driveName, driveType, driveFs);
+        // Deliberate: after a provider change only the roots up to the first
+        // rebuilt one are rebuilt for that reason.
+        cacheValid = true;
+        return 0;
+    }
+    if (rc == 2) {
+        log->traceMIN(__LINE__, __FILE__, __func__,
+                      "IMPORTANT: (TIMEOUT) File system access on '%S' (drive: '%S', type: %d, fs: '%S')",
+                      rootPath, driveName, driveType, driveFs);
+        return 2;
+    }
+    log->traceMIN(__LINE__, __FILE__, __func__,
+                  "IMPORTANT: (ACCESS FAILED) File system access on '%S' (drive: '%S', type: %d, fs: '%S')",
+                  rootPath, driveName, driveType, driveFs);
+    return 1;
+}
+
+int FS_CacheBase::extractFromCache(FsResultSetWriter& writer, FsQuery const& query,
+                                   PathHelper& pathHelper, bool caseFlag, unsigned int timeout)
+{
+    if (cacheRemoteDrives) {
+        localIncludePaths.insert(localIncludePaths.end(), remoteIncludePaths.begin(),
+                                 remoteIncludePaths.end());
+        localExcludePaths.insert(localExcludePaths.end(), remoteExcludePaths.begin(),
+                                 remoteExcludePaths.end());
+    }
+    pathHelper.removePathListDuplicate(localIncludePaths);
+    pathHelper.removePathListDuplicate(localExcludePaths);
+    int result;
+    if (filesCursor != nullptr && directoriesCursor != nullptr) {
+        result = extractResults(writer, query.getQuery(), driveList, includeParentResolved,
+                                localIncludePaths, localExcludePaths, *filesCursor,
+                                *directoriesCursor, caseFlag, static_cast<int>(timeout));
+    } else if (localIncludePaths.empty()) {
+        // Nothing to read: extraction ends before it touches a cursor.
+        RecordSet none;
+        result = extractResults(writer, query.getQuery(), driveList, includeParentResolved,
+                                localIncludePaths, localExcludePaths, none, none, caseFlag,
+                                static_cast<int>(timeout));
+    } else {
+        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - cache cursors are not open!",
+                      className, driverName);
+        result = CACHE_UNUSABLE;
+    }
+    log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - exit. [retValue is %d]", className,
+                  driverName, result);
+    return result;
 }

@@ -5,11 +5,13 @@
 #define FSCANNER_FSCOMMON_CACHEBASE_H
 
 #include <cstdio>
+#include <ctime>
 #include <map>
 #include <string>
 #include <vector>
 
 #include "fscanner/fs/fs_fileinfo.h"
+#include "fscanner/fscommon/expvalue.h"
 
 class AbstractMutex;
 class FS_Table;
@@ -21,6 +23,14 @@ class FileHashBlackBox;
 class FsQuery;
 class FsResultSetWriter;
 class QvLogWrapper;
+class PathHelper;
+
+// One entry of the path memo: a directory's own component (kelm_malloc
+// block of 0x4004 bytes, owned) and its parent's id.
+struct MapItem {
+    wchar_t* text;
+    unsigned int parentId;
+};
 
 // Options the creator hands the engine.  Only tail is set by the constructor.
 struct FsGlue {
@@ -158,6 +168,43 @@ public:
     bool buildLookups();
     void deleteLookups();
 
+    // True if the whole path exists; its last component's row is then
+    // current in first.  Both cursors are repositioned.
+    bool findPathByName(RecordSet& first, RecordSet& second, wchar_t* path, bool caseSensitive);
+    // Full path of directory id into buffer (size in wide characters); false
+    // on a broken chain, id 0 or a buffer too small.
+    bool findPathById(RecordSet& directories, unsigned int id, wchar_t* buffer, unsigned int size);
+    // Removes every file row of directory pathId.
+    void removeFiles(FS_Table* files, unsigned int pathId);
+    // Removes the directory id, every row below it and their files.
+    void removeTree(FS_Table* directories, FS_Table* files, unsigned int id);
+    // Releases the texts of the path memo and empties it.
+    void clearPathMemo();
+
+    // --- cache scan (cache_scan.cpp) ---
+    // Scans root into the tables; 0 done, 2 timed out.
+    int build(FsQuery const& query, PathDrive& root, RecordSet& directories,
+              unsigned int& directoriesIndex, RecordSet& files, RecordSet& directories2,
+              std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
+              int timeoutMs);
+    // Walks path and writes its rows below parentId; 0, or 2 when the budget
+    // ran out.
+    int scan(FsQuery const& query, PathDrive& path, RecordSet& directories,
+             unsigned int& directoriesIndex, RecordSet& files, int parentId,
+             std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
+             int timeoutMs, int logDepth);
+
+    // --- extraction (cache_extract.cpp) ---
+    // Writes every row of files that passes query and lies in a directory the
+    // paths ask for.  0, SCAN_TIMED_OUT when timeoutMs (counted from the call)
+    // runs out, CACHE_UNUSABLE when a directory's path cannot be rebuilt.
+    // Not reentrant: it uses two process-wide path buffers.
+    int extractResults(FsResultSetWriter& writer, wchar_t const* query,
+                       std::vector<DriveInfo>& drives, std::vector<PathDrive>& roots,
+                       std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes,
+                       RecordSet& files, RecordSet& directories, bool caseSensitive,
+                       int timeoutMs);
+
     // New new[] string: directory, '/' unless it ends in one, name, suffix.
     static wchar_t* getCacheFileName(wchar_t const* directory, wchar_t const* name,
                                      wchar_t const* suffix);
@@ -184,6 +231,8 @@ public:
     size_t narrowPathBufferSize;
     wchar_t* wideNameBuffer;
     size_t wideNameBufferSize;
+    // Directory id -> component and parent id, of the ids walked last.
+    std::map<int, MapItem> pathMemo;
     Fields* defaultVariables;
     // id, pathid, parentid, pathname, shortpathname, filename, shortfilename,
     // md5, crc32, q32: handles into defaultVariables, not owned.
@@ -191,6 +240,8 @@ public:
     // critPathId, critParentId, critId, critPathOrShortPath, critPathName,
     // critFileOrShortFile, critFileName.
     CriteriaEvaluator* criteria[7];
+    // Column and value of the one index lookup under way.
+    ExpValue hashValue;
     std::map<std::string, ExcludeMD5> excludeMd5;
     wchar_t* exHashFileName;
     std::string lastMd5OfPaths;
@@ -235,7 +286,27 @@ public:
     wchar_t* catSetFileName;
 
 private:
+    // Points set at the rows whose column equals a value, through the hash
+    // index: the column and value go into hashValue, the value into the
+    // variable, then the criterion is set on the cursor.  text null: the
+    // value is number.  True when a first row is current.
+    bool lookUp(RecordSet& set, int criterion, wchar_t const* column, int variable,
+                unsigned int number, wchar_t const* text, bool caseSensitive);
+    // Decides one local root of a query and rebuilds it when the cache may
+    // not serve it: -1 served from the cache, 0 built, 2 build timed out,
+    // 1 build failed otherwise.  cacheValid carries over to the next root.
+    int visitLocalRoot(FsQuery const& query, PathDrive& root, PathHelper& pathHelper,
+                       bool caseFlag, unsigned int timeout, unsigned int maxCacheAge,
+                       time_t now, bool& cacheValid);
+    // The end of every query: extraction with the lists of the resolution
+    // that last ran.
+    int extractFromCache(FsResultSetWriter& writer, FsQuery const& query, PathHelper& pathHelper,
+                         bool caseFlag, unsigned int timeout);
     bool createTables();
+    // Opens the files cursor and both directories cursors on the open tables;
+    // dropCursors forgets the handles (the tables own the cursors).
+    void openCursors();
+    void dropCursors();
     void exclusionDigest(std::vector<PathInfo>& excludes, bool throttle, unsigned int (*digest)[4]);
     static std::string exclusionKey(wchar_t const* root);
 };

@@ -1,11 +1,19 @@
 #include "fscanner/fscommon/cachetables.h"
 
+#include <cwchar>
 #include <string>
+#include <vector>
 
 #include "base/QvLogWrapper.h"
+#include "base/kelmem.h"
 #include "fscanner/fscommon/cachebase.h"
 #include "fscanner/fscommon/criteria.h"
 #include "fscanner/fscommon/fields.h"
+#include "fscanner/fscommon/fsbuild.h"
+#include "fscanner/fscommon/pathhelper.h"
+#include "fscanner/fscommon/recordset.h"
+#include "fscanner/fscommon/stringhelper.h"
+#include "fscanner/fscommon/wildcard.h"
 #include "fscanner/fscommon/table.h"
 
 namespace cachetables {
@@ -48,13 +56,15 @@ bool createTable(FS_Table** slot, wchar_t const* name, wchar_t const* dir, bool 
     for (unsigned int i = 0; i < count && ok; ++i)
         ok = table->addField(columns[i], types[i]);
     ok = ok && table->create();
-    for (unsigned int i = 0; i < indexCount && ok; ++i) {
-        std::wstring indexName = std::wstring(name) + L"_" + indexes[i];
-        ok = table->addHashIndex(indexName.c_str(), indexes[i]);
-    }
     if (!ok) {
         delete table;
         return false;
+    }
+    // A missing index is not fatal: lookups on that column then walk the
+    // table through the criteria instead.
+    for (unsigned int i = 0; i < indexCount; ++i) {
+        std::wstring indexName = std::wstring(name) + L"_" + indexes[i];
+        table->addHashIndex(indexName.c_str(), indexes[i]);
     }
     *slot = table;
     return true;
@@ -108,4 +118,232 @@ void FS_CacheBase::deleteLookups()
         variableHandles[i] = nullptr;
     delete defaultVariables;
     defaultVariables = nullptr;
+}
+
+// ------------------------------------------------------------------ lookups
+
+bool FS_CacheBase::lookUp(RecordSet& set, int criterion, wchar_t const* column, int variable,
+                          unsigned int number, wchar_t const* text, bool caseSensitive)
+{
+    CriteriaEvaluator* evaluator = criteria[criterion];
+    Field* handle = variableHandles[variable];
+    if (evaluator == nullptr || handle == nullptr || set.isEmpty())
+        return false;
+    hashValue.clear();
+    hashValue.setNValueString(column);
+    if (text != nullptr) {
+        hashValue.setString(text);
+        static_cast<TextField*>(handle)->value(text);
+    } else {
+        hashValue.setNumericValue(number);
+        static_cast<Int32Field*>(handle)->value(number);
+    }
+    evaluator->setHashInfo(hashValue);
+    set.setCriteria(evaluator, caseSensitive);
+    return set.moveFirst();
+}
+
+bool FS_CacheBase::findPathByName(RecordSet& first, RecordSet& second, wchar_t* path,
+                                  bool caseSensitive)
+{
+    if (path == nullptr)
+        return false;
+    PathHelper helper(1);
+    std::vector<PathInfo> prefixes;
+    std::vector<PathInfo> names;
+    helper.pathReducer(PathInfo(path, true), prefixes, names);
+    if (names.empty() || names[0].getPathName() == nullptr)
+        return false;
+    size_t last = names.size() - 1;
+
+    for (bool row = lookUp(first, cachetables::CRIT_PATH_NAME, L"PATHNAME",
+                           cachetables::VAR_PATHNAME, 0, names[0].getPathName(), caseSensitive);
+         row; row = first.moveNext()) {
+        unsigned int parent = first.getFieldAsInt32(L"PARENTID");
+        if (last == 0) {
+            if (parent == 0)
+                return true;
+            continue;
+        }
+        // Walk up the chain; the topmost component must sit at the top.
+        unsigned int current = parent;
+        for (size_t k = 1; k <= last; ++k) {
+            if (!lookUp(second, cachetables::CRIT_ID, L"ID", cachetables::VAR_ID, current,
+                        nullptr, true))
+                break;
+            wchar_t const* component = second.getFieldAsString(L"PATHNAME");
+            wchar_t const* wanted = names[k].getPathName();
+            if (component == nullptr || wanted == nullptr ||
+                wcsvccmp(wanted, component, caseSensitive) != 0)
+                break;
+            unsigned int upper = second.getFieldAsInt32(L"PARENTID");
+            if (k == last) {
+                if (upper == 0)
+                    return true;
+                break;
+            }
+            current = upper;
+        }
+    }
+    return false;
+}
+
+void FS_CacheBase::clearPathMemo()
+{
+    for (std::map<int, MapItem>::iterator it = pathMemo.begin(); it != pathMemo.end(); ++it)
+        kelm_free(it->second.text);
+    pathMemo.clear();
+}
+
+bool FS_CacheBase::findPathById(RecordSet& directories, unsigned int id, wchar_t* buffer,
+                                unsigned int size)
+{
+    if (buffer == nullptr || size == 0)
+        return false;
+    buffer[0] = L'\0';
+    wchar_t separator[2] = {PathHelper::PathSeparator, L'\0'};
+    unsigned int current = id;
+    while (current != 0) {
+        if (pathMemo.size() > cachetables::MEMO_ENTRIES)
+            clearPathMemo();
+        bool failed = false;
+        wchar_t* component = nullptr;
+        unsigned int parent = 0;
+        std::map<int, MapItem>::iterator hit = pathMemo.find(static_cast<int>(current));
+        if (hit != pathMemo.end()) {
+            component = hit->second.text;
+            parent = hit->second.parentId;
+        } else if (!lookUp(directories, cachetables::CRIT_ID, L"ID", cachetables::VAR_ID, current,
+                           nullptr, true)) {
+            failed = true;
+        } else {
+            wchar_t const* name = directories.getFieldAsString(L"PATHNAME");
+            parent = directories.getFieldAsInt32(L"PARENTID");
+            component = static_cast<wchar_t*>(kelm_malloc(cachetables::MEMO_TEXT_BYTES));
+            if (component != nullptr) {
+                // A component longer than the block is cut; the prepend
+                // below then refuses the path as too long for any buffer.
+                size_t room = cachetables::MEMO_TEXT_BYTES / sizeof(wchar_t) - 1;
+                size_t n = name != nullptr ? wcslen(name) : 0;
+                if (n > room)
+                    n = room;
+                if (n != 0)
+                    wmemcpy(component, name, n);
+                component[n] = L'\0';
+                MapItem item;
+                item.text = component;
+                item.parentId = parent;
+                int key = static_cast<int>(directories.getFieldAsInt32(L"ID"));
+                std::map<int, MapItem>::iterator old = pathMemo.find(key);
+                if (old != pathMemo.end()) {
+                    kelm_free(old->second.text);
+                    pathMemo.erase(old);
+                }
+                pathMemo[key] = item;
+            }
+        }
+        if (!failed && component == nullptr)
+            failed = true;
+        if (!failed) {
+            size_t n = wcslen(component);
+            if (buffer[0] != L'\0' && (n == 0 || component[n - 1] != PathHelper::PathSeparator))
+                failed = wcs_stringCat(separator, buffer, size) == 0;
+            if (!failed)
+                failed = wcs_stringCat(component, buffer, size) == 0;
+        }
+        if (failed) {
+            // current is never 0 inside the loop: a broken walk is a failure.
+            buffer[0] = L'\0';
+            return false;
+        }
+        current = parent;
+    }
+    return buffer[0] != L'\0';
+}
+
+void FS_CacheBase::removeFiles(FS_Table* files, unsigned int pathId)
+{
+    if (files == nullptr)
+        return;
+    RecordSet set = files->openRecordSet();
+    for (bool row = lookUp(set, cachetables::CRIT_PATH_ID, L"PATHID", cachetables::VAR_PATHID,
+                           pathId, nullptr, true);
+         row; row = set.moveNext())
+        set.remove();
+    if (!files->closeRecordSet(set))
+        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - closeRecordSet failed!", className,
+                      __func__);
+}
+
+void FS_CacheBase::removeTree(FS_Table* directories, FS_Table* files, unsigned int id)
+{
+    if (directories == nullptr)
+        return;
+    // Ids of removed rows must not be answered from the memo any more.
+    clearPathMemo();
+    RecordSet set = directories->openRecordSet();
+    for (bool row = lookUp(set, cachetables::CRIT_PARENT_ID, L"PARENTID",
+                           cachetables::VAR_PARENTID, id, nullptr, true);
+         row;) {
+        removeTree(directories, files, set.getFieldAsInt32(L"ID"));
+        // The recursion wrote its own id into the shared variable.
+        static_cast<Int32Field*>(variableHandles[cachetables::VAR_PARENTID])->value(id);
+        row = set.moveNext();
+    }
+    removeFiles(files, id);
+    if (lookUp(set, cachetables::CRIT_ID, L"ID", cachetables::VAR_ID, id, nullptr, true))
+        set.remove();
+    if (!directories->closeRecordSet(set))
+        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - closeRecordSet failed!", className,
+                      __func__);
+}
+
+// ----------------------------------------------------------- query functions
+
+int chPathCommand::execute(ExpValue const& left, ExpValue const& right, ExpValue& result)
+{
+    QvLogWrapper* log = getQvLogFs();
+    wchar_t const* name = right.getStringValue();
+    if (name == nullptr || name[0] == L'\0' || cache == nullptr ||
+        cache->tbDirectories == nullptr) {
+        log->traceMIN(__LINE__, __FILE__, __func__, "chPathCommand::execute - args not valid!");
+        return 1;
+    }
+    // The cursor stays with the table, which deletes it when it closes.
+    RecordSet directories = cache->tbDirectories->openRecordSet();
+    std::vector<wchar_t> buffer(cachetables::PATH_CHARS);
+    if (!cache->findPathById(directories, static_cast<unsigned int>(left.getNumber()),
+                             buffer.data(), cachetables::PATH_CHARS)) {
+        log->traceMIN(__LINE__, __FILE__, __func__,
+                      "chPathCommand::execute - findPathById(...) failed!");
+        return 1;
+    }
+    wchar_t* full = getFullPathName(buffer.data(), name);
+    if (full == nullptr) {
+        log->traceMIN(__LINE__, __FILE__, __func__,
+                      "chPathCommand::execute - getFullPathName(...) failed!");
+        return 1;
+    }
+    result.setString(full);
+    kelm_free(full);
+    return 0;
+}
+
+int chTypeCommand::execute(ExpValue const& left, ExpValue const& right, ExpValue& result)
+{
+    QvLogWrapper* log = getQvLogFs();
+    wchar_t const* path = left.getStringValue();
+    wchar_t const* wanted = right.getStringValue();
+    if (!left.isString() || !right.isString() || path == nullptr || wanted == nullptr ||
+        path[0] == L'\0' || wanted[0] == L'\0') {
+        log->traceMIN(__LINE__, __FILE__, __func__, "chTypeCommand::execute - args not valid!\n");
+        return 1;
+    }
+    StringList<wchar_t> types;
+    types.insert(wanted);
+    int retValue = checker.check(path, types) ? 1 : 0;
+    result.setNumericValue(static_cast<unsigned long long>(retValue));
+    log->traceMAX(__LINE__, __FILE__, __func__, "chTypeCommand::execute - exit. [retValue is %d]\n",
+                  retValue);
+    return 0;
 }

@@ -13,6 +13,11 @@
 #ifndef FSCANNER_FSCOMMON_CACHETABLES_H
 #define FSCANNER_FSCOMMON_CACHETABLES_H
 
+#include "fscanner/fscommon/expvalue.h"
+#include "fscanner/fscommon/filetypehelper.h"
+
+class FS_CacheBase;
+
 namespace cachetables {
 const unsigned int TYPE_INT32 = 3;
 const unsigned int TYPE_INT64 = 4;
@@ -30,6 +35,38 @@ extern wchar_t const* const variableNames[10];
 extern unsigned int const variableTypes[10];
 // The prepared criteria, in order.
 extern wchar_t const* const criteriaTexts[7];
+// Indexes of the prepared criteria and of the lookup variables.
+enum Criterion { CRIT_PATH_ID, CRIT_PARENT_ID, CRIT_ID, CRIT_PATH_OR_SHORT_PATH, CRIT_PATH_NAME,
+                 CRIT_FILE_OR_SHORT_FILE, CRIT_FILE_NAME };
+enum Variable { VAR_ID, VAR_PATHID, VAR_PARENTID, VAR_PATHNAME, VAR_SHORTPATHNAME, VAR_FILENAME,
+                VAR_SHORTFILENAME, VAR_MD5, VAR_CRC32, VAR_Q32 };
+// Longest path, in wide characters, that the lookups rebuild.
+const unsigned int PATH_CHARS = 4096;
+// Size in bytes of one memo text.
+const unsigned int MEMO_TEXT_BYTES = 0x4004;
+// The memo is flushed whole once it holds more entries than this.
+const unsigned int MEMO_ENTRIES = 32;
 }  // namespace cachetables
+
+// The query function path(directory id, file name) over cache rows: the full
+// path of the file, rebuilt from the directories table of cache.
+class chPathCommand : public BinaryCmd {
+public:
+    explicit chPathCommand(FS_CacheBase* cache) : cache(cache) {}
+    int execute(ExpValue const& left, ExpValue const& right, ExpValue& result) override;
+
+private:
+    FS_CacheBase* cache;
+};
+
+// The query function type(path, wanted words): 1 when the file's type
+// description holds one of the words, else 0.
+class chTypeCommand : public BinaryCmd {
+public:
+    int execute(ExpValue const& left, ExpValue const& right, ExpValue& result) override;
+
+private:
+    FileTypeChecker checker;
+};
 
 #endif

@@ -317,9 +317,8 @@ FS_Table::~FS_Table() {
         delete mutex;
         mutex = nullptr;
     }
-    // Cursors are owned by the table; their class lives with the cursor code,
-    // which is what creates and deletes them.
-    recordSets.clear();
+    // Cursors are owned by the table.
+    deleteRecordSets();
 }
 
 wchar_t* FS_Table::indexListPath() { return wideJoin(directory, indexListName); }
@@ -422,7 +421,7 @@ bool FS_Table::open() {
         return false;
     }
     retrieveHashIndexList(indexes);
-    recordSets.clear();
+    // Cursors opened before this call stay owned and go with close().
     bitmapSize = bitmapBytes(fieldCount);
     return true;
 }
@@ -439,7 +438,8 @@ bool FS_Table::close() {
         pointerFile = nullptr;
     }
     freeHashIndexList(indexes);
-    recordSets.clear();
+    // A cursor never outlives the open table it walks.
+    deleteRecordSets();
     schema.removeAll();
     return true;
 }

@@ -170,6 +170,22 @@ public:
     AbstractFile* getPointerFile() const { return pointerFile; }
     std::vector<Index*>& getIndexes() { return indexes; }
 
+    // Cursors: the table owns every cursor it opens; close() and the
+    // destructor delete them.  closeRecordSet deletes set's cursor and clears
+    // the handle; false when the cursor is not this table's.
+    RecordSet openRecordSet();
+    bool closeRecordSet(RecordSet& set);
+
+    // On a closed table: copies the live records into a fresh table when the
+    // deleted count exceeds percent of the stored count, rebuilds the indexes
+    // there and swaps the files in.  Leaves the table closed.  True for a
+    // finished or skipped compaction; false for an open table, one that would
+    // not open, or a failure on the way.
+    bool compact(int percent);
+    // Test seam: when set, called after each record the copy phase of
+    // compact() has stored, with the number of records copied so far.
+    static void (*compactCopyHook)(unsigned int copied);
+
     static void setBit(unsigned int index, unsigned char* buffer);
     static bool checkBit(unsigned int index, unsigned char const* buffer);
 
@@ -178,6 +194,7 @@ private:
     FS_Table& operator=(const FS_Table&) = delete;
 
     void freeNames();
+    void deleteRecordSets();
     bool growScratch(unsigned int characters);
     bool readSlot(unsigned int id, uint32_t* offset);
     bool writeValue(Field* field);

@@ -1,0 +1,416 @@
+// Extraction of hits from the cache tables: rows are filled through cursors,
+// then extractResults decides per directory and writes what the paths ask for.
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "fscanner/fs/fs_query.h"
+#include "fscanner/fs/fs_resultset.h"
+#include "fscanner/fscommon/cache2.h"
+#include "fscanner/fscommon/cache_common.h"
+#include "fscanner/fscommon/filehash.h"
+#include "fscanner/fscommon/recordset.h"
+#include "fscanner/fscommon/sync.h"
+#include "fscanner/fscommon/table.h"
+#include "support/testsupport.h"
+
+namespace {
+
+std::wstring widen(const std::string& s) { return std::wstring(s.begin(), s.end()); }
+
+std::string narrow(const wchar_t* w)
+{
+    std::string out;
+    for (; w != nullptr && *w != L'\0'; ++w)
+        out += static_cast<char>(*w);
+    return out;
+}
+
+struct Hit {
+    std::string path;
+    std::string name;
+    unsigned long long size;
+    unsigned int attr;
+    std::string md5;
+    unsigned int crc32;
+    unsigned int q32;
+};
+
+class CollectingWriter : public FsResultSetWriter {
+public:
+    int addRecord(const wchar_t* path, const wchar_t* name, unsigned long long size,
+                  unsigned int attr, const wchar_t* md5, unsigned int crc32,
+                  unsigned int q32) override {
+        hits.push_back(Hit{narrow(path), narrow(name), size, attr, narrow(md5), crc32, q32});
+        return 0;
+    }
+    int addRecord(const FsFileInfo&) override { return -1; }
+    int close() override { return 0; }
+    std::vector<std::string> names() const {
+        std::vector<std::string> out;
+        for (const Hit& h : hits)
+            out.push_back(h.path + h.name);
+        return out;
+    }
+    std::vector<Hit> hits;
+};
+
+FsGlue plainGlue()
+{
+    FsGlue glue;
+    glue.knownHashes = nullptr;
+    glue.checksumFlags = 0;
+    glue.reserved = 0;
+    glue.cacheRemoteDrives = false;
+    return glue;
+}
+
+struct ExtractTest : ::testing::Test {
+    testsupport::TempDir locks;
+    // Lock files go to a temp dir before the cache object makes any.
+    bool storeSet = (LinuxSharedMutex::setStorePath(locks.path().c_str()), true);
+    testsupport::TempDir cacheDir;
+    testsupport::TempDir tree;
+    FsGlue glue = plainGlue();
+    FS_Cache cacheObject{L"dirs", L"files", widen(cacheDir.path()).c_str(), false, true, &glue, L"prov"};
+    FS_Cache* cache = &cacheObject;
+    __recordSet* dirCursor = nullptr;
+    __recordSet* fileCursor = nullptr;
+    RecordSet dirs;
+    RecordSet files;
+    unsigned int nextId = 1;
+    std::vector<DriveInfo> drives;
+    std::vector<PathDrive> roots;
+    std::vector<PathInfo> includes;
+    std::vector<PathInfo> excludes;
+    std::string base;  // the tree's path, e.g. /tmp/xyz
+
+    ExtractTest() {
+        base = tree.path();
+        while (base.size() > 1 && base.back() == '/')
+            base.pop_back();
+        drives.push_back(DriveInfo(L"/", dtLocal, L"ext4"));
+    }
+    ~ExtractTest() override {
+        delete dirCursor;
+        delete fileCursor;
+        cache->close();
+    }
+    void open() {
+        ASSERT_EQ(0, cache->create(0, FS_CACHE_CREATE));
+        dirCursor = new __recordSet(cache->tbDirectories);
+        fileCursor = new __recordSet(cache->tbFiles);
+        dirs = RecordSet(dirCursor);
+        files = RecordSet(fileCursor);
+    }
+    unsigned int addDir(const std::wstring& name, unsigned int parent) {
+        unsigned int id = nextId++;
+        dirs.setFieldAsInt32(L"ID", id);
+        dirs.setFieldAsString(L"PATHNAME", name.c_str());
+        dirs.setFieldAsInt32(L"PARENTID", parent);
+        dirs.setFieldAsInt32(L"CREATIONTIME", 0);
+        EXPECT_TRUE(dirs.insert());
+        return id;
+    }
+    // Rows for every component of an absolute path; the id of the last.
+    unsigned int addChain(const std::string& path) {
+        unsigned int parent = addDir(L"/", 0);
+        size_t pos = 1;
+        while (pos < path.size()) {
+            size_t next = path.find('/', pos);
+            if (next == std::string::npos)
+                next = path.size();
+            if (next > pos)
+                parent = addDir(widen(path.substr(pos, next - pos)), parent);
+            pos = next + 1;
+        }
+        return parent;
+    }
+    void addFile(const std::string& name, unsigned int pathId, unsigned long long size,
+                 unsigned int attr = 0x8000, const wchar_t* md5 = L"0", unsigned int crc = 0,
+                 unsigned int q32 = 0) {
+        files.setFieldAsString(L"FILENAME", widen(name).c_str());
+        files.setFieldAsInt32(L"ATTR", attr);
+        files.setFieldAsInt64(L"SIZE", size);
+        files.setFieldAsInt32(L"PATHID", pathId);
+        files.setFieldAsString(L"MD5", md5);
+        files.setFieldAsInt32(L"CRC32", crc);
+        files.setFieldAsInt32(L"Q32", q32);
+        EXPECT_TRUE(files.insert());
+    }
+    void addRoot(const std::string& path) {
+        roots.push_back(PathDrive(widen(path).c_str(), true, drives[0]));
+    }
+    void include(const std::string& path, bool recursive = true) {
+        includes.push_back(PathInfo(widen(path).c_str(), recursive));
+    }
+    int extract(CollectingWriter& w, const wchar_t* query = L"[SIZE]>=0", int timeout = 100000) {
+        return cache->extractResults(w, query, drives, roots, includes, excludes, files, dirs, false,
+                                     timeout);
+    }
+
+    // Layout used by most tests:  <base>/data (a.txt 10, b.log 200),
+    // <base>/data/sub (c.txt 300), <base>/other (d.txt 40).
+    unsigned int dataId = 0, subId = 0, otherId = 0;
+    void standardTree() {
+        open();
+        unsigned int baseId = addChain(base);
+        dataId = addDir(L"data", baseId);
+        subId = addDir(L"sub", dataId);
+        otherId = addDir(L"other", baseId);
+        addFile("a.txt", dataId, 10);
+        addFile("b.log", dataId, 200);
+        addFile("c.txt", subId, 300);
+        addFile("d.txt", otherId, 40);
+        addRoot(base + "/data");
+    }
+};
+
+}  // namespace
+
+TEST_F(ExtractTest, NoIncludedPathsReturnsZeroAndWritesNothing)
+{
+    standardTree();
+    CollectingWriter w;
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(0, extract(w));
+    EXPECT_TRUE(w.hits.empty());
+    EXPECT_TRUE(cap.contains("FS_Cache::extractResults - no included paths specified!"));
+}
+
+TEST_F(ExtractTest, IncludedDirectoriesAreWrittenWithTrailingSeparatorAndRowValues)
+{
+    standardTree();
+    include(base + "/data");
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w));
+    std::vector<std::string> expected = {base + "/data/a.txt", base + "/data/b.log",
+                                         base + "/data/sub/c.txt"};
+    EXPECT_EQ(expected, w.names());
+    ASSERT_EQ(3u, w.hits.size());
+    EXPECT_EQ(base + "/data/", w.hits[0].path);
+    EXPECT_EQ(10u, w.hits[0].size);
+    EXPECT_EQ(0x8000u, w.hits[0].attr);
+    // A cache without checksums reports "0", 0 and 0.
+    EXPECT_EQ("0", w.hits[0].md5);
+    EXPECT_EQ(0u, w.hits[0].crc32);
+    EXPECT_EQ(0u, w.hits[0].q32);
+}
+
+TEST_F(ExtractTest, ExpressionIsAppliedByTheCursor)
+{
+    standardTree();
+    include(base + "/data");
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w, L"[SIZE]>=100"));
+    std::vector<std::string> expected = {base + "/data/b.log", base + "/data/sub/c.txt"};
+    EXPECT_EQ(expected, w.names());
+}
+
+TEST_F(ExtractTest, DecisionIsMadeOncePerDirectory)
+{
+    standardTree();
+    include(base + "/data");
+    CollectingWriter w;
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(0, extract(w));
+    EXPECT_EQ(1u, cap.count("FS_Cache::extractResults PATH INCLUDED: '" + base + "/data'"));
+    EXPECT_EQ(1u, cap.count(("FS_Cache::extractResults PATH INCLUDED: '" + base + "/data/sub'").c_str()));
+    EXPECT_EQ(1u, cap.count(("FS_Cache::extractResults PATH NOT included: '" + base + "/other'").c_str()));
+    EXPECT_EQ(3u, cap.count("FS_Cache::extractResults bIncludeFile=false"));
+    EXPECT_TRUE(cap.contains(("FS_Cache::extractResults building excludeList for pathIndex=0 for: '" +
+                              base + "/data'").c_str()));
+}
+
+TEST_F(ExtractTest, DirectoryOutsideEveryRootIsNeverReportedEvenIfIncluded)
+{
+    standardTree();
+    include(base + "/data");
+    include(base + "/other");
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w));
+    for (const std::string& n : w.names())
+        EXPECT_EQ(std::string::npos, n.find("d.txt")) << n;
+    EXPECT_EQ(3u, w.hits.size());
+}
+
+TEST_F(ExtractTest, WithRemoteCachingTheRootTestsAreSkipped)
+{
+    standardTree();
+    cache->cacheRemoteDrives = true;
+    include(base + "/other");
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w));
+    std::vector<std::string> expected = {base + "/other/d.txt"};
+    EXPECT_EQ(expected, w.names());
+}
+
+TEST_F(ExtractTest, TwoQueriesWithDifferentIncludesGiveDifferentResultsFromSameRows)
+{
+    standardTree();
+    include(base + "/data/sub");
+    CollectingWriter w1;
+    EXPECT_EQ(0, extract(w1));
+    std::vector<std::string> first = {base + "/data/sub/c.txt"};
+    EXPECT_EQ(first, w1.names());
+
+    includes.clear();
+    include(base + "/data", false);
+    CollectingWriter w2;
+    EXPECT_EQ(0, extract(w2));
+    std::vector<std::string> second = {base + "/data/a.txt", base + "/data/b.log"};
+    EXPECT_EQ(second, w2.names());
+}
+
+TEST_F(ExtractTest, ExcludedDirectoryIsNotReported)
+{
+    standardTree();
+    include(base + "/data");
+    excludes.push_back(PathInfo(widen(base + "/data/sub").c_str(), true));
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w));
+    std::vector<std::string> expected = {base + "/data/a.txt", base + "/data/b.log"};
+    EXPECT_EQ(expected, w.names());
+}
+
+TEST_F(ExtractTest, TimeoutZeroReturnsScanTimedOutAtFirstMatchingRowAndWritesNothing)
+{
+    standardTree();
+    include(base + "/data");
+    CollectingWriter w;
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(-41, extract(w, L"[SIZE]>=0", 0));
+    EXPECT_TRUE(w.hits.empty());
+    EXPECT_TRUE(cap.contains("FS_Cache::extractResults - timed out!"));
+}
+
+TEST_F(ExtractTest, TimeoutZeroWithNoMatchingRowReturnsZero)
+{
+    standardTree();
+    include(base + "/data");
+    CollectingWriter w;
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(0, extract(w, L"[SIZE]>=100000", 0));
+    EXPECT_TRUE(w.hits.empty());
+    EXPECT_FALSE(cap.contains("timed out!"));
+}
+
+TEST_F(ExtractTest, BrokenDirectoryChainReturnsCacheUnusable)
+{
+    standardTree();
+    include(base + "/data");
+    // Remove the row of "data": the chain of "sub" and of data's files breaks.
+    bool removed = false;
+    for (bool more = dirs.moveFirst(); more; more = dirs.moveNext()) {
+        if (dirs.getFieldAsInt32(L"ID") == dataId) {
+            removed = dirs.remove();
+            break;
+        }
+    }
+    ASSERT_TRUE(removed);
+    CollectingWriter w;
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(-40, extract(w));
+    EXPECT_TRUE(w.hits.empty());
+    EXPECT_TRUE(cap.contains("FS_Cache::extractResults - findPathById() failed! extract interrupted!"));
+}
+
+TEST_F(ExtractTest, EmptyKnownHashesSetBehavesAsNoSet)
+{
+    standardTree();
+    FileHashBlackBox none;
+    cache->knownHashes = &none;
+    include(base + "/data");
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w));
+    EXPECT_EQ(3u, w.hits.size());
+}
+
+TEST_F(ExtractTest, KnownHashesFilterComputesSumsFromTheFileButReportsTheRow)
+{
+    open();
+    tree.write("hit.txt", "hello");
+    tree.write("miss.txt", "other");
+    unsigned int baseId = addChain(base);
+    addFile("hit.txt", baseId, 5);
+    addFile("miss.txt", baseId, 5);
+    addRoot(base);
+    include(base);
+    FileHashBlackBox wanted;
+    wanted.insert_crc32(0x3610a686u);  // CRC-32 of "hello"
+    cache->knownHashes = &wanted;
+    cache->computeChecksums = false;
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w));
+    ASSERT_EQ(1u, w.hits.size());
+    EXPECT_EQ("hit.txt", w.hits[0].name);
+    // The sum computed for the filter does not reach the record.
+    EXPECT_EQ(0u, w.hits[0].crc32);
+    EXPECT_EQ("0", w.hits[0].md5);
+}
+
+TEST_F(ExtractTest, SymbolicLinkHasZeroSumsAndIsNotOpened)
+{
+    open();
+    tree.write("link.txt", "hello");  // content would match, but a link is not read
+    unsigned int baseId = addChain(base);
+    addFile("link.txt", baseId, 5, 0x1000 | 0x8000);
+    addRoot(base);
+    include(base);
+    FileHashBlackBox wanted;
+    wanted.insert_crc32(0x3610a686u);
+    cache->knownHashes = &wanted;
+    cache->computeChecksums = false;
+    CollectingWriter w1;
+    EXPECT_EQ(0, extract(w1));
+    EXPECT_TRUE(w1.hits.empty());
+
+    // Zero sums are what find sees for it.
+    FileHashBlackBox zero;
+    zero.insert_crc32(0);
+    cache->knownHashes = &zero;
+    CollectingWriter w2;
+    EXPECT_EQ(0, extract(w2));
+    ASSERT_EQ(1u, w2.hits.size());
+    EXPECT_EQ("link.txt", w2.hits[0].name);
+}
+
+TEST_F(ExtractTest, WithComputedChecksumsTheRowSumsAreFiltered)
+{
+    open();
+    unsigned int baseId = addChain(base);
+    // Neither file exists: only the stored sums can decide.
+    addFile("stored.bin", baseId, 5, 0x8000, L"5d41402abc4b2a76b9719d911017c592", 0x3610a686u, 7);
+    addFile("plain.bin", baseId, 5, 0x8000, L"0", 1, 2);
+    addRoot(base);
+    include(base);
+    FileHashBlackBox wanted;
+    wanted.insert_crc32(0x3610a686u);
+    cache->knownHashes = &wanted;
+    cache->computeChecksums = true;
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w));
+    ASSERT_EQ(1u, w.hits.size());
+    EXPECT_EQ("stored.bin", w.hits[0].name);
+    EXPECT_EQ(0x3610a686u, w.hits[0].crc32);
+    EXPECT_EQ(7u, w.hits[0].q32);
+    EXPECT_EQ("5d41402abc4b2a76b9719d911017c592", w.hits[0].md5);
+}
+
+TEST_F(ExtractTest, MissingFileCountsAsZeroSums)
+{
+    open();
+    unsigned int baseId = addChain(base);
+    addFile("gone.txt", baseId, 5);
+    addRoot(base);
+    include(base);
+    FileHashBlackBox zero;
+    zero.insert_crc32(0);
+    cache->knownHashes = &zero;
+    cache->computeChecksums = false;
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w));
+    ASSERT_EQ(1u, w.hits.size());
+    EXPECT_EQ("gone.txt", w.hits[0].name);
+}
