@@ -11,6 +11,7 @@
 #include "fscanner/fs/fs_query.h"
 #include "fscanner/fscommon/cache2.h"
 #include "fscanner/fscommon/sync.h"
+#include "fscanner/fscommon/recordset.h"
 #include "support/testsupport.h"
 
 namespace {
@@ -269,6 +270,56 @@ TEST_F(CacheTest, CompactOnOpenedCheckedCacheLatchesUnusable)
     ASSERT_EQ(0, c.create(0, FS_CACHE_CREATE));
     EXPECT_FALSE(c.compact());
     EXPECT_TRUE(c.cacheUnusable);
+}
+
+TEST_F(CacheTest, CompactAfterCloseDropsRemovedRowsAndTheCacheOpensWhole)
+{
+    {
+        FS_Cache c(L"dirs", L"files", wdir.c_str(), false, true, &glue, L"prov");
+        ASSERT_EQ(0, c.create(0, FS_CACHE_CREATE));
+        RecordSet& files = *c.filesCursor;
+        for (unsigned int i = 0; i < 100; ++i) {
+            files.setFieldAsString(L"FILENAME", (L"f" + std::to_wstring(i)).c_str());
+            files.setFieldAsInt32(L"ATTR", 0);
+            files.setFieldAsInt64(L"SIZE", i);
+            files.setFieldAsInt32(L"PATHID", 1);
+            files.setFieldAsString(L"MD5", L"0");
+            files.setFieldAsInt32(L"CRC32", 0);
+            files.setFieldAsInt32(L"Q32", 0);
+            ASSERT_TRUE(files.insert());
+        }
+        // Remove every other row: half the stored records are dead.
+        int n = 0;
+        for (bool row = files.moveFirst(); row; row = files.moveNext())
+            if (n++ % 2 == 0)
+                files.remove();
+        std::string data = dir.file("files.dat");
+        long before = testsupport::readFile(data).size();
+        ASSERT_TRUE(c.close());
+        ASSERT_TRUE(c.compact());
+        EXPECT_FALSE(c.cacheUnusable);
+        EXPECT_LT(static_cast<long>(testsupport::readFile(data).size()), before);
+    }
+    FS_Cache c(L"dirs", L"files", wdir.c_str(), false, true, &glue, L"prov");
+    ASSERT_EQ(0, c.create(0, FS_CACHE_OPEN));
+    std::set<unsigned long long> sizes;
+    for (bool row = c.filesCursor->moveFirst(); row; row = c.filesCursor->moveNext())
+        sizes.insert(c.filesCursor->getFieldAsInt64(L"SIZE"));
+    EXPECT_EQ(50u, sizes.size());
+    EXPECT_EQ(0u, sizes.count(0));
+    EXPECT_EQ(1u, sizes.count(1));
+    EXPECT_EQ(1u, sizes.count(99));
+    c.close();
+}
+
+TEST_F(CacheTest, CompactOnAnOpenUncheckedCacheFailsAndLatchesUnusable)
+{
+    FS_Cache c(L"dirs", L"files", wdir.c_str(), false, false, &glue, L"prov");
+    ASSERT_EQ(0, c.create(0, FS_CACHE_CREATE));
+    // Open tables are not compacted.
+    EXPECT_FALSE(c.compact());
+    EXPECT_TRUE(c.cacheUnusable);
+    c.close();
 }
 
 TEST_F(CacheTest, LockAndUnlockTraceMilestones)

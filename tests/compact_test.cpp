@@ -302,7 +302,7 @@ TEST_F(CompactTest, IndexKeepsNameAndFieldAndFindsNewNumbers) {
     t->close();
 }
 
-TEST_F(CompactTest, IndexFailureAtCountCheckLeavesTableUsable) {
+TEST_F(CompactTest, FailedTemporaryIndexLeavesTableUsableAndNextRunReplacesLeftovers) {
     auto t = build(5, 3, true);
     std::string dat = file("tab.dat");
     // A directory where the temporary index file must go makes its creation fail.

@@ -513,11 +513,15 @@ bool FS_CacheBase::compact()
     }
     if (tbFiles == nullptr || tbDirectories == nullptr)
         return false;
-    // TODO(table compaction): the tables do not offer compaction yet; refuse
-    // rather than claim success.
-    log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - table compaction not available",
-                  className, __func__);
-    return false;
+    // The update flag covers the copy: a compaction cut short leaves a cache
+    // that the next create refuses to open.
+    beginCacheUpdate();
+    bool directoriesDone = tbDirectories->compact(30);
+    bool filesDone = tbFiles->compact(30);
+    if (!directoriesDone || !filesDone)
+        cacheUnusable = true;
+    endCacheUpdate();
+    return directoriesDone && filesDone;
 }
 
 namespace {

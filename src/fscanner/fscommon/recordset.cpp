@@ -76,7 +76,7 @@ bool __recordSet::setCriteria(CriteriaEvaluator* criteria, bool caseSensitive) {
                 if (key != nullptr) std::memcpy(key, text, n * sizeof(wchar_t));
             }
             if (key != nullptr) {
-                //wcsupper(key);
+                wcsupper(key);
                 index = found;
             }
         }

@@ -92,6 +92,7 @@ private:
     __recordSet& operator=(const __recordSet&) = delete;
 
     void forgetIndex();
+    bool fits();
 
     unsigned int id;
     unsigned int position;
