@@ -42,3 +42,16 @@ m32:
 
 clean:
 	rm -rf $(BUILD) $(ASAN_BUILD) $(M32_BUILD)
+
+# Every fuzz/*.cpp as a libFuzzer program in $(FUZZ_BUILD); the library is
+# compiled by clang with coverage and the address and undefined-behaviour
+# checks, so a fault anywhere in a reader stops the run.
+FUZZ_BUILD ?= build-fuzz
+FUZZ_FLAGS ?= -fsanitize=fuzzer-no-link,address,undefined -fno-sanitize-recover=undefined -fno-omit-frame-pointer
+
+.PHONY: fuzz
+fuzz:
+	CC=clang CXX=clang++ $(CMAKE) -S . -B $(FUZZ_BUILD) -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+	  -DFSCANNER_BUILD_FUZZ=ON -DFSCANNER_BUILD_TESTS=OFF -DFSCANNER_BUILD_BENCH=OFF \
+	  -DCMAKE_CXX_FLAGS="$(FUZZ_FLAGS)" -DCMAKE_C_FLAGS="$(FUZZ_FLAGS)"
+	$(CMAKE) --build $(FUZZ_BUILD) --target fuzzers -j $(JOBS)

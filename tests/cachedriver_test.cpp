@@ -3,6 +3,7 @@
 #include <string>
 #include <vector>
 
+#include "base/KelCfg.h"
 #include "fscanner/fs/fs_query.h"
 #include "fscanner/fs/fs_resultset.h"
 #include "fscanner/fscommon/cache2.h"
@@ -49,6 +50,7 @@ struct DriverTest : ::testing::Test {
     testsupport::TempDir cacheDir;
     testsupport::TempDir tree;
     testsupport::TempDir sys;
+    testsupport::TempDir traces;
     FsGlue glue;
     std::string remote;
     DriverTest() {
@@ -65,10 +67,13 @@ struct DriverTest : ::testing::Test {
         sys.write("mtab", "/dev/sda1 / ext4 rw 0 0\n");
         MountTableManager::setMountTablePath(sys.file("mtab").c_str());
         DriveHelper::setAutomounterMasterPath(sys.file("auto.master").c_str());
+        // A build writes the folder log there, never to the real trace path.
+        KelCfg::setKey("common_trace_path", traces.path().c_str());
     }
     ~DriverTest() override {
         MountTableManager::setMountTablePath(nullptr);
         DriveHelper::setAutomounterMasterPath(nullptr);
+        KelCfg::removeKey("common_trace_path");
     }
     void addRemoteMount() {
         sys.write("mtab", "/dev/sda1 / ext4 rw 0 0\nsrv:/export " + remote + " nfs rw 0 0\n");

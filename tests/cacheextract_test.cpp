@@ -2,6 +2,8 @@
 // then extractResults decides per directory and writes what the paths ask for.
 #include <gtest/gtest.h>
 
+#include <unistd.h>
+
 #include <string>
 #include <vector>
 
@@ -9,6 +11,7 @@
 #include "fscanner/fs/fs_resultset.h"
 #include "fscanner/fscommon/cache2.h"
 #include "fscanner/fscommon/cache_common.h"
+#include "fscanner/fscommon/expvalue.h"
 #include "fscanner/fscommon/filehash.h"
 #include "fscanner/fscommon/recordset.h"
 #include "fscanner/fscommon/sync.h"
@@ -55,6 +58,38 @@ public:
     }
     std::vector<Hit> hits;
 };
+
+// A writer that takes its time over every record.
+class SlowWriter : public CollectingWriter {
+public:
+    int addRecord(const wchar_t* path, const wchar_t* name, unsigned long long size,
+                  unsigned int attr, const wchar_t* md5, unsigned int crc32,
+                  unsigned int q32) override {
+        usleep(30000);
+        return CollectingWriter::addRecord(path, name, size, attr, md5, crc32, q32);
+    }
+};
+
+// A writer that refuses every record, and counts the attempts.
+class RefusingWriter : public FsResultSetWriter {
+public:
+    int addRecord(const wchar_t*, const wchar_t*, unsigned long long, unsigned int, const wchar_t*,
+                  unsigned int, unsigned int) override {
+        ++attempts;
+        return -1;
+    }
+    int addRecord(const FsFileInfo&) override { return -1; }
+    int close() override { return 0; }
+    int attempts = 0;
+};
+
+std::string upper(std::string s)
+{
+    for (char& c : s)
+        if (c >= 'a' && c <= 'z')
+            c = static_cast<char>(c - 'a' + 'A');
+    return s;
+}
 
 FsGlue plainGlue()
 {
@@ -413,4 +448,177 @@ TEST_F(ExtractTest, MissingFileCountsAsZeroSums)
     EXPECT_EQ(0, extract(w));
     ASSERT_EQ(1u, w.hits.size());
     EXPECT_EQ("gone.txt", w.hits[0].name);
+}
+
+TEST_F(ExtractTest, PerRootExcludesLeaveOutAMountOfAnotherKindBelowTheRoot)
+{
+    standardTree();
+    // <base>/data/sub is an xfs disk below the root <base>/data on ext4.
+    drives.push_back(DriveInfo(widen(base + "/data/sub:").c_str(), dtLocal, L"xfs"));
+    include(base + "/data");
+    CollectingWriter w;
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(0, extract(w));
+    std::vector<std::string> expected = {base + "/data/a.txt", base + "/data/b.log"};
+    EXPECT_EQ(expected, w.names());
+    EXPECT_EQ(1u, cap.count("FS_Cache::extractResults building excludeList for pathIndex=0 for: '" +
+                            base + "/data'"));
+    EXPECT_TRUE(cap.contains("FS_Cache::extractResults PATH NOT included: '" + base + "/data/sub'"));
+
+    // With remote caching the per-root test is skipped: sub is reported.
+    cache->cacheRemoteDrives = true;
+    CollectingWriter w2;
+    EXPECT_EQ(0, extract(w2));
+    std::vector<std::string> all = {base + "/data/a.txt", base + "/data/b.log",
+                                    base + "/data/sub/c.txt"};
+    EXPECT_EQ(all, w2.names());
+}
+
+TEST_F(ExtractTest, EachRootHasItsOwnExcludes)
+{
+    standardTree();
+    // An nfs mount below <base>/other only.
+    drives.push_back(DriveInfo(widen(base + "/other:").c_str(), dtRemote, L"nfs"));
+    unsigned int deepId = addDir(L"deep", otherId);
+    addFile("e.txt", deepId, 50);
+    drives.push_back(DriveInfo(widen(base + "/other/deep:").c_str(), dtLocal, L"xfs"));
+    addRoot(base + "/other");
+    include(base + "/data");
+    include(base + "/other");
+    CollectingWriter w;
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(0, extract(w));
+    // data's rows under its own (empty) excludes, other's under its own,
+    // which cut out the xfs disk below it.
+    std::vector<std::string> expected = {base + "/data/a.txt", base + "/data/b.log",
+                                         base + "/data/sub/c.txt", base + "/other/d.txt"};
+    EXPECT_EQ(expected, w.names());
+    EXPECT_TRUE(cap.contains("building excludeList for pathIndex=1 for: '" + base + "/other'"));
+    EXPECT_TRUE(cap.contains("FS_Cache::extractResults PATH NOT included: '" + base + "/other/deep'"));
+}
+
+TEST_F(ExtractTest, FirstRowWithPathIdZeroCountsAsTheSameDirectoryNotIncluded)
+{
+    open();
+    addFile("orphan.txt", 0, 1);  // the very first row of the table
+    unsigned int baseId = addChain(base);
+    addFile("kept.txt", baseId, 2);
+    addRoot(base);
+    include(base);
+    CollectingWriter w;
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(0, extract(w));
+    std::vector<std::string> expected = {base + "/kept.txt"};
+    EXPECT_EQ(expected, w.names());
+    // One decision only: the orphan row was no new directory.
+    EXPECT_EQ(1u, cap.count("FS_Cache::extractResults bIncludeFile=false"));
+    EXPECT_FALSE(cap.contains("findPathById() failed!"));
+}
+
+TEST_F(ExtractTest, CaseInsensitiveQueryGetsTheDirectoryTextAsStoredInTheCache)
+{
+    standardTree();
+    roots.clear();
+    roots.push_back(PathDrive(widen(upper(base + "/data")).c_str(), true, drives[0]));
+    include(upper(base + "/DATA/SUB"));
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w));  // extract() asks case-insensitively
+    ASSERT_EQ(1u, w.hits.size());
+    EXPECT_EQ(base + "/data/sub/", w.hits[0].path);
+    EXPECT_EQ("c.txt", w.hits[0].name);
+
+    CollectingWriter strict;
+    EXPECT_EQ(0, cache->extractResults(strict, L"[SIZE]>=0", drives, roots, includes, excludes,
+                                       files, dirs, true, 100000));
+    EXPECT_TRUE(strict.hits.empty());
+}
+
+TEST_F(ExtractTest, PathCommandGivesTheFullPathOfTheRow)
+{
+    standardTree();
+    include(base);
+    addRoot(base);
+    CollectingWriter w;
+    std::wstring query = widen("path([PATHID],[FILENAME])==\"" + base + "/data/sub/c.txt\"");
+    EXPECT_EQ(0, extract(w, query.c_str()));
+    std::vector<std::string> expected = {base + "/data/sub/c.txt"};
+    EXPECT_EQ(expected, w.names());
+
+    CollectingWriter masked;
+    std::wstring wild = widen("path([PATHID],[FILENAME])==\"" + base + "/data/*.txt\"");
+    EXPECT_EQ(0, extract(masked, wild.c_str()));
+    std::vector<std::string> both = {base + "/data/a.txt", base + "/data/sub/c.txt"};
+    EXPECT_EQ(both, masked.names());
+}
+
+TEST_F(ExtractTest, TypeCommandAsksTheFileCommandAboutTheRow)
+{
+    open();
+    tree.write("run.sh", "#!/bin/sh\necho hello\n");
+    tree.write("note.txt", "just some words\n");
+    unsigned int baseId = addChain(base);
+    addFile("run.sh", baseId, 21);
+    addFile("note.txt", baseId, 16);
+    addRoot(base);
+    include(base);
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w, L"type(path([PATHID],[FILENAME]),\"script\")==1"));
+    std::vector<std::string> expected = {base + "/run.sh"};
+    EXPECT_EQ(expected, w.names());
+}
+
+TEST_F(ExtractTest, CommandsLeaveTheSharedTableWithTheExtraction)
+{
+    standardTree();
+    include(base + "/data");
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w, L"path([PATHID],[FILENAME])==\"*\""));
+    EXPECT_EQ(3u, w.hits.size());
+    EXPECT_TRUE(cmdTokenTable().empty());
+    // And so the cache's own lookups still parse: "pathid" is no command.
+    cache->removeFiles(cache->tbFiles, dataId);
+    CollectingWriter after;
+    EXPECT_EQ(0, extract(after));
+    std::vector<std::string> expected = {base + "/data/sub/c.txt"};
+    EXPECT_EQ(expected, after.names());
+}
+
+TEST_F(ExtractTest, TimeIsCheckedAtEveryRowNotOncePerDirectory)
+{
+    open();
+    unsigned int baseId = addChain(base);
+    for (int i = 0; i < 10; ++i)
+        addFile("f" + std::to_string(i), baseId, 1);
+    addRoot(base);
+    include(base);
+    SlowWriter w;
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(-41, extract(w, L"[SIZE]>=0", 100));
+    EXPECT_GE(w.hits.size(), 1u);
+    EXPECT_LT(w.hits.size(), 10u);
+    EXPECT_TRUE(cap.contains("FS_Cache::extractResults - timed out!"));
+}
+
+TEST_F(ExtractTest, RefusedRecordsAreNotNoticed)
+{
+    standardTree();
+    include(base + "/data");
+    RefusingWriter w;
+    EXPECT_EQ(0, cache->extractResults(w, L"[SIZE]>=0", drives, roots, includes, excludes, files,
+                                       dirs, false, 100000));
+    EXPECT_EQ(3, w.attempts);
+}
+
+TEST_F(ExtractTest, EmptyKnownHashesSetGivesTheSameRecordsAsNoSet)
+{
+    standardTree();
+    include(base + "/data");
+    CollectingWriter plain;
+    EXPECT_EQ(0, extract(plain));
+    FileHashBlackBox none;
+    cache->knownHashes = &none;
+    cache->computeChecksums = false;
+    CollectingWriter filtered;
+    EXPECT_EQ(0, extract(filtered));
+    EXPECT_EQ(plain.names(), filtered.names());
 }

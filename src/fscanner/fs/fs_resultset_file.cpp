@@ -73,6 +73,16 @@ bool compareBySize(void* a, void* b, unsigned int op, bool flag) {
     return compareByKey(a, b, op, flag, FsFileInfo::COMPARE_SIZE);
 }
 
+// A load that fails before the end of the file met damaged bytes and stopped
+// somewhere inside them.  The sort must not go on reading from there: it
+// would take the middle of a string for a new record and put records into the
+// sorted file that a reader never saw.  So damage ends the input, as it ends
+// a reader's walk: the file is moved to its end.  At the real end this is no
+// move at all, so valid files sort as before.
+void endInputAtDamage(AbstractFile* file) {
+    file->seek(0, SEEK_FROM_END);
+}
+
 int readRecord(AbstractFile* file, void** record) {
     if (record == nullptr) return 0;
     *record = nullptr;
@@ -82,6 +92,7 @@ int readRecord(AbstractFile* file, void** record) {
     FsSerializator_OnFile serializator(file, false);
     if (info->loadObject(serializator) != 0) {
         delete info;
+        endInputAtDamage(file);
         return 0;
     }
     *record = info;
@@ -110,6 +121,7 @@ bool peekRecord(AbstractFile* file, void** record) {
         return true;
     }
     delete info;
+    endInputAtDamage(file);
     return false;
 }
 

@@ -70,6 +70,12 @@ struct ExtractionState {
         delete evaluator;
         delete pathCommand;
         delete typeCommand;
+        // The shared command table still names "path" and "type", with the
+        // commands just deleted.  Empty it: a name left there would also
+        // change how the cache's own criteria read when one of them is first
+        // parsed later ("pathid" lexes as the command path and the variable
+        // id), and the rows of a removed tree would then stay behind.
+        cmdTokenTable().clear();
     }
 };
 

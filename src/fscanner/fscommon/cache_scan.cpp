@@ -74,6 +74,8 @@ bool narrowFilePath(wchar_t const* directory, wchar_t const* name, char* out)
 
 }  // namespace
 
+void (*FS_CacheBase::scanHook)(char const* directory) = nullptr;
+
 int FS_CacheBase::build(FsQuery const& query, PathDrive& root, RecordSet& directories,
                         unsigned int& directoriesIndex, RecordSet& files, RecordSet& directories2,
                         std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes,
@@ -249,6 +251,8 @@ int FS_CacheBase::scan(FsQuery const& query, PathDrive& path, RecordSet& directo
         }
         return 0;
     }
+    if (scanHook != nullptr)
+        scanHook(narrowPathBuffer);
     unsigned int start = utils::getTickCount();
 
     // The directory's path with one separator: room for the longest child.

@@ -302,6 +302,10 @@ void FS_CacheBase::deleteTable(FS_Table* table)
 
 void FS_CacheBase::openTable(FS_Table** tableSlot, wchar_t const* name)
 {
+    // An object reused after close() still holds the closed tables of its
+    // last run: they go before the new ones come.
+    dropCursors();
+    deleteTable(*tableSlot);
     *tableSlot = new FS_Table(name, cachePathName, tableFlag);
     if (!(*tableSlot)->open()) {
         delete *tableSlot;
@@ -311,6 +315,11 @@ void FS_CacheBase::openTable(FS_Table** tableSlot, wchar_t const* name)
 
 bool FS_CacheBase::createTables()
 {
+    dropCursors();
+    deleteTable(tbFiles);
+    tbFiles = nullptr;
+    deleteTable(tbDirectories);
+    tbDirectories = nullptr;
     if (!createFilesTable(&tbFiles, filesTableName))
         return false;
     if (!createDirectoriesTable(&tbDirectories, directoriesTableName)) {
@@ -1009,9 +1018,17 @@ int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery con
                 pathHelper.extractPathList(excludeResolved, mdOtherDriveGroup, remoteExcludePaths);
                 pathHelper.buildExcludeList(driveList, root, remoteExcludePaths);
                 pathHelper.fillExclude(root, excludeResolved, remoteExcludePaths);
-                FileProcessor processor(query.getQuery(), caseFlag);
-                int rc = fs_build(writer, processor, root, remoteIncludePaths, remoteExcludePaths,
+                int rc;
+                {
+                    FileProcessor processor(query.getQuery(), caseFlag);
+                    rc = fs_build(writer, processor, root, remoteIncludePaths, remoteExcludePaths,
                                   caseFlag, 2000000000);
+                }
+                // The walk's commands are gone with its processor; their names
+                // must not stay in the shared table, where they would change
+                // how the cache's criteria parse on their first use (see the
+                // end of extractResults).
+                cmdTokenTable().clear();
                 if (rc == 2) {
                     log->traceMIN(__LINE__, __FILE__, __func__,
                                   "%s::%s - fs scanning timed out (timeout)", className, __func__);

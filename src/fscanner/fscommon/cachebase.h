@@ -194,6 +194,10 @@ public:
              std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
              int timeoutMs, int logDepth);
 
+    // Test seam: when set, scan calls it with each directory's narrow path
+    // right after reading the directory, before visiting its entries.
+    static void (*scanHook)(char const* directory);
+
     // --- extraction (cache_extract.cpp) ---
     // Writes every row of files that passes query and lies in a directory the
     // paths ask for.  0, SCAN_TIMED_OUT when timeoutMs (counted from the call)

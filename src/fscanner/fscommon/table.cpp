@@ -1010,15 +1010,24 @@ bool FS_Table::hashIndex_moveFirst(Index& index, wchar_t const* key, unsigned in
 
 bool FS_Table::hashIndex_moveNext(Index& index, unsigned int& id, unsigned int& next) {
     if (pointerFile == nullptr) return false;
-    // A chain longer than the index file has slots is a loop in damaged data.
-    unsigned long long guard = 0;
+    // Index::write appends every overflow slot at the end of the file and
+    // links it to slots that were there before, so along a sound chain the
+    // overflow slot numbers fall strictly and never reach the buckets.  A
+    // link that does not fall is damage (a loop would spin here, or in the
+    // cursor that calls again): the chain ends at it, next becomes the end
+    // mark, and sound chains walk exactly as before.
     while (next != Index::EMPTY) {
-        if (++guard > 0x20000000ull) return false;
+        if (next < Index::BUCKETS) {
+            next = Index::EMPTY;
+            return false;
+        }
         unsigned int candidate, after;
         if (!index.read(next, &candidate, &after)) {
             // An unreadable slot ends the chain here rather than spinning on it.
+            next = Index::EMPTY;
             return false;
         }
+        if (after != Index::EMPTY && after >= next) after = Index::EMPTY;
         next = after;
         uint32_t slot;
         if (!readSlot(candidate, &slot)) return false;

@@ -185,6 +185,11 @@ public:
     // Test seam: when set, called after each record the copy phase of
     // compact() has stored, with the number of records copied so far.
     static void (*compactCopyHook)(unsigned int copied);
+    // Test seam: when set, called as compact() passes each stage: 1 the
+    // temporary table exists, 2 the copy is done, 3 the indexes are swapped
+    // in, 4 the old data and pointer files are removed, 5 the new ones are in
+    // place.
+    static void (*compactStageHook)(int stage);
 
     static void setBit(unsigned int index, unsigned char* buffer);
     static bool checkBit(unsigned int index, unsigned char const* buffer);
