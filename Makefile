@@ -6,7 +6,7 @@ M32_BUILD  ?= build-m32
 JOBS       ?= $(shell nproc 2>/dev/null || echo 2)
 CMAKE      ?= cmake
 
-.PHONY: all build test run asan m32 clean
+.PHONY: all build test run bench asan m32 clean
 
 all: build
 
@@ -19,8 +19,24 @@ build: $(BUILD)/CMakeCache.txt
 test: build
 	cd $(BUILD) && ctest --output-on-failure -j $(JOBS)
 
+# `make run`: the query tool with a name query over /usr, twice, on a cache
+# under the build directory: the first run builds the cache, the second is
+# served from it (see the --stats lines on standard error).
+RUN_CACHE ?= $(BUILD)/run-cache
+RUN_QUERY ?= --name 'stdio.h' /usr
+
 run: build
-	$(BUILD)/fscanner_hello
+	@rm -rf $(RUN_CACHE)
+	@echo "== fsquery, first run: builds the cache"
+	$(BUILD)/fsquery --cache $(RUN_CACHE) --stats $(RUN_QUERY)
+	@echo "== fsquery, second run: served from the cache"
+	$(BUILD)/fsquery --cache $(RUN_CACHE) --stats $(RUN_QUERY)
+
+# `make bench`: fsquery against find, fd and plocate on a generated tree
+# (BENCH_ENTRIES entries, default 200000; RUNS repetitions, default 5).
+BENCH_ENTRIES ?= 200000
+bench: build
+	BUILD=$(BUILD) bench/fsquery_bench.sh $(BENCH_ENTRIES)
 
 asan:
 	$(CMAKE) -S . -B $(ASAN_BUILD) -DCMAKE_BUILD_TYPE=Debug -DFSCANNER_BUILD_BENCH=OFF \

@@ -622,3 +622,18 @@ TEST_F(ExtractTest, EmptyKnownHashesSetGivesTheSameRecordsAsNoSet)
     EXPECT_EQ(0, extract(filtered));
     EXPECT_EQ(plain.names(), filtered.names());
 }
+
+TEST_F(ExtractTest, EmptyExpressionLeavesTheCursorUnfilteredAndEveryRowCounts)
+{
+    standardTree();
+    include(base + "/data");
+    CollectingWriter w;
+    EXPECT_EQ(0, extract(w, L""));
+    std::vector<std::string> expected = {base + "/data/a.txt", base + "/data/b.log",
+                                         base + "/data/sub/c.txt"};
+    EXPECT_EQ(expected, w.names());
+    CollectingWriter none;
+    EXPECT_EQ(0, cache->extractResults(none, nullptr, drives, roots, includes, excludes, files,
+                                       dirs, false, 100000));
+    EXPECT_EQ(expected, none.names());
+}

@@ -51,11 +51,7 @@ void makeTree(testsupport::TempDir& tree, int dirs, int files)
 int query(const std::string& cacheDir, const std::string& root, int disposition,
           std::set<std::string>* hits, unsigned int maxAge = LONG_AGE)
 {
-    FsGlue glue;
-    glue.knownHashes = nullptr;
-    glue.checksumFlags = 0;
-    glue.reserved = 0;
-    glue.cacheRemoteDrives = false;
+    FsGlue glue = testsupport::plainGlue();
     FS_Cache cache(L"dirs", L"files", widen(cacheDir).c_str(), false, true, &glue, L"prov");
     int rc = cache.create(0, disposition);
     if (rc != 0)
@@ -171,11 +167,7 @@ TEST_F(DrillTest, ProcessKilledAfterTheQueryBeforeCloseIsNeverServed)
     makeTree(tree, 5, 4);
     std::set<std::string> expected = testsupport::findFiles(root);
     int how = inChild([&] {
-        FsGlue glue;
-        glue.knownHashes = nullptr;
-        glue.checksumFlags = 0;
-        glue.reserved = 0;
-        glue.cacheRemoteDrives = false;
+        FsGlue glue = testsupport::plainGlue();
         FS_Cache c(L"dirs", L"files", widen(cache.path()).c_str(), false, true, &glue, L"prov");
         if (c.create(0, FS_CACHE_OPEN_ALWAYS) != 0)
             _exit(3);
@@ -202,11 +194,7 @@ TEST_F(DrillTest, CompactionKilledAtEachStageLeavesACacheServedWholeOrRebuilt)
     // change of the excludes made the old tree invalid.
     testsupport::TempDir pristine;
     {
-        FsGlue glue;
-        glue.knownHashes = nullptr;
-        glue.checksumFlags = 0;
-        glue.reserved = 0;
-        glue.cacheRemoteDrives = false;
+        FsGlue glue = testsupport::plainGlue();
         FS_Cache c(L"dirs", L"files", widen(pristine.path()).c_str(), false, true, &glue, L"prov");
         FsQuery q;
         q.setQuery(L"[SIZE]>=0");
@@ -228,11 +216,7 @@ TEST_F(DrillTest, CompactionKilledAtEachStageLeavesACacheServedWholeOrRebuilt)
         testsupport::removeTree(cache.path());
         ASSERT_EQ(0, system(("cp -a '" + pristine.path() + "' '" + cache.path() + "'").c_str()));
         int how = inChild([&] {
-            FsGlue glue;
-            glue.knownHashes = nullptr;
-            glue.checksumFlags = 0;
-            glue.reserved = 0;
-            glue.cacheRemoteDrives = false;
+            FsGlue glue = testsupport::plainGlue();
             FS_Cache c(L"dirs", L"files", widen(cache.path()).c_str(), false, true, &glue,
                        L"prov");
             if (c.create(0, FS_CACHE_OPEN) != 0)
@@ -254,11 +238,7 @@ TEST_F(DrillTest, CompactionKilledAtEachStageLeavesACacheServedWholeOrRebuilt)
     testsupport::removeTree(cache.path());
     ASSERT_EQ(0, system(("cp -a '" + pristine.path() + "' '" + cache.path() + "'").c_str()));
     {
-        FsGlue glue;
-        glue.knownHashes = nullptr;
-        glue.checksumFlags = 0;
-        glue.reserved = 0;
-        glue.cacheRemoteDrives = false;
+        FsGlue glue = testsupport::plainGlue();
         FS_Cache c(L"dirs", L"files", widen(cache.path()).c_str(), false, true, &glue, L"prov");
         ASSERT_EQ(0, c.create(0, FS_CACHE_OPEN));
         c.close();
@@ -281,11 +261,7 @@ TEST_F(DrillTest, TwoProcessesTakingTurnsThroughTheLockNeverCorruptTheCache)
     // taken through one object made before the workers start, whose
     // descriptor both inherit; each query runs on an object of its own, in
     // the caller's order: construct, create, query, close, destroy.
-    FsGlue glue;
-    glue.knownHashes = nullptr;
-    glue.checksumFlags = 0;
-    glue.reserved = 0;
-    glue.cacheRemoteDrives = false;
+    FsGlue glue = testsupport::plainGlue();
     FS_Cache guard(L"dirs", L"files", widen(cache.path()).c_str(), false, true, &glue, L"prov");
     auto worker = [&]() {
         for (int i = 0; i < perProcess; ++i) {

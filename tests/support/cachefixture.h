@@ -36,6 +36,18 @@ inline std::string joinPath(const std::string& dir, const std::string& name)
     return dir + "/" + name;
 }
 
+// Options of a cache that computes no checksums and walks remote trees
+// directly.
+inline FsGlue plainGlue()
+{
+    FsGlue glue;
+    glue.knownHashes = nullptr;
+    glue.checksumFlags = 0;
+    glue.reserved = 0;
+    glue.cacheRemoteDrives = false;
+    return glue;
+}
+
 // Collects the full path of every hit, from either form of addRecord.
 class HitWriter : public FsResultSetWriter {
 public:
