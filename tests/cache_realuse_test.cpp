@@ -24,46 +24,13 @@
 #include "fscanner/fscommon/drivehelper.h"
 #include "fscanner/fscommon/mountlist.h"
 #include "fscanner/fscommon/sync.h"
-#include "support/testsupport.h"
+#include "support/cachefixture.h"
 
 namespace {
 
-std::wstring widen(const std::string& s) { return std::wstring(s.begin(), s.end()); }
-
-std::string narrow(const wchar_t* w)
-{
-    std::string out;
-    for (; w != nullptr && *w != L'\0'; ++w)
-        out += static_cast<char>(*w);
-    return out;
-}
-
-std::string joinPath(const std::string& dir, const std::string& name)
-{
-    if (!dir.empty() && dir.back() == '/')
-        return dir + name;
-    return dir + "/" + name;
-}
-
-// Full paths of the hits, from the cached form of addRecord and from the
-// direct walk's FsFileInfo form; records counts duplicates too.
-class PathWriter : public FsResultSetWriter {
-public:
-    int addRecord(const wchar_t* path, const wchar_t* name, unsigned long long, unsigned int,
-                  const wchar_t*, unsigned int, unsigned int) override {
-        hits.insert(joinPath(narrow(path), narrow(name)));
-        ++records;
-        return 0;
-    }
-    int addRecord(const FsFileInfo& info) override {
-        hits.insert(joinPath(narrow(info.getPath()), narrow(info.getName())));
-        ++records;
-        return 0;
-    }
-    int close() override { return 0; }
-    std::set<std::string> hits;
-    size_t records = 0;
-};
+using testsupport::plainGlue;
+using testsupport::widen;
+using PathWriter = testsupport::HitWriter;
 
 // Lines printed by a find command, one path each.
 std::set<std::string> findLines(const std::string& command)
@@ -102,16 +69,6 @@ std::string difference(const std::set<std::string>& want, const std::set<std::st
 std::string findFiles(const std::string& root, const std::string& tests)
 {
     return "find '" + root + "' " + tests + " \\( -type f -o -type l \\) -print";
-}
-
-FsGlue plainGlue()
-{
-    FsGlue glue;
-    glue.knownHashes = nullptr;
-    glue.checksumFlags = 0;
-    glue.reserved = 0;
-    glue.cacheRemoteDrives = false;
-    return glue;
 }
 
 const unsigned int TEN_YEARS = 10u * 365u * 86400u;

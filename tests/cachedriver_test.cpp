@@ -11,19 +11,12 @@
 #include "fscanner/fscommon/drivehelper.h"
 #include "fscanner/fscommon/mountlist.h"
 #include "fscanner/fscommon/sync.h"
-#include "support/testsupport.h"
+#include "support/cachefixture.h"
 
 namespace {
 
-std::wstring widen(const std::string& s) { return std::wstring(s.begin(), s.end()); }
-
-std::string narrow(const wchar_t* w)
-{
-    std::string out;
-    for (; w != nullptr && *w != L'\0'; ++w)
-        out += static_cast<char>(*w);
-    return out;
-}
+using testsupport::widen;
+std::string narrow(const wchar_t* w) { return testsupport::bytesOf(w); }
 
 class RecordingWriter : public FsResultSetWriter {
 public:

@@ -16,19 +16,13 @@
 #include "fscanner/fscommon/recordset.h"
 #include "fscanner/fscommon/sync.h"
 #include "fscanner/fscommon/table.h"
-#include "support/testsupport.h"
+#include "support/cachefixture.h"
 
 namespace {
 
-std::wstring widen(const std::string& s) { return std::wstring(s.begin(), s.end()); }
-
-std::string narrow(const wchar_t* w)
-{
-    std::string out;
-    for (; w != nullptr && *w != L'\0'; ++w)
-        out += static_cast<char>(*w);
-    return out;
-}
+using testsupport::plainGlue;
+using testsupport::widen;
+std::string narrow(const wchar_t* w) { return testsupport::bytesOf(w); }
 
 struct Hit {
     std::string path;
@@ -89,16 +83,6 @@ std::string upper(std::string s)
         if (c >= 'a' && c <= 'z')
             c = static_cast<char>(c - 'a' + 'A');
     return s;
-}
-
-FsGlue plainGlue()
-{
-    FsGlue glue;
-    glue.knownHashes = nullptr;
-    glue.checksumFlags = 0;
-    glue.reserved = 0;
-    glue.cacheRemoteDrives = false;
-    return glue;
 }
 
 struct ExtractTest : ::testing::Test {

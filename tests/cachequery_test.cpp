@@ -19,70 +19,18 @@
 #include "fscanner/fscommon/mountlist.h"
 #include "fscanner/fscommon/recordset.h"
 #include "fscanner/fscommon/sync.h"
-#include "support/testsupport.h"
+#include "support/cachefixture.h"
 
 namespace {
 
-std::wstring widen(const std::string& s) { return std::wstring(s.begin(), s.end()); }
+using testsupport::plainGlue;
+using testsupport::widen;
+using PathWriter = testsupport::HitWriter;
 
-std::string narrow(const wchar_t* w)
-{
-    std::string out;
-    for (; w != nullptr && *w != L'\0'; ++w)
-        out += static_cast<char>(*w);
-    return out;
-}
-
-std::string joinPath(const std::string& dir, const std::string& name)
-{
-    if (!dir.empty() && dir.back() == '/')
-        return dir + name;
-    return dir + "/" + name;
-}
-
-// Collects full paths of hits from either form of addRecord.
-class PathWriter : public FsResultSetWriter {
-public:
-    int addRecord(const wchar_t* path, const wchar_t* name, unsigned long long, unsigned int,
-                  const wchar_t*, unsigned int, unsigned int) override {
-        hits.insert(joinPath(narrow(path), narrow(name)));
-        ++records;
-        return 0;
-    }
-    int addRecord(const FsFileInfo& info) override {
-        hits.insert(joinPath(narrow(info.getPath()), narrow(info.getName())));
-        ++records;
-        return 0;
-    }
-    int close() override { return 0; }
-    std::set<std::string> hits;
-    int records = 0;
-};
-
+// Regular files as find(1) lists them; extra being more find arguments.
 std::set<std::string> findFiles(const std::string& root, const std::string& extra)
 {
-    std::string out = testsupport::runCommand("find '" + root + "' -type f " + extra + " 2>/dev/null");
-    std::set<std::string> files;
-    size_t pos = 0;
-    while (pos < out.size()) {
-        size_t nl = out.find('\n', pos);
-        if (nl == std::string::npos)
-            nl = out.size();
-        if (nl > pos)
-            files.insert(out.substr(pos, nl - pos));
-        pos = nl + 1;
-    }
-    return files;
-}
-
-FsGlue plainGlue()
-{
-    FsGlue glue;
-    glue.knownHashes = nullptr;
-    glue.checksumFlags = 0;
-    glue.reserved = 0;
-    glue.cacheRemoteDrives = false;
-    return glue;
+    return testsupport::findFiles(root, "-type f " + extra);
 }
 
 struct QueryTest : ::testing::Test {
@@ -142,7 +90,7 @@ TEST_F(QueryTest, FixtureTreeHitsEqualFindThroughBothCacheClasses)
         testsupport::TraceCapture cap;
         EXPECT_EQ(0, c.executeQueryEx(w, q, 600000, 3600));
         EXPECT_EQ(expected, w.hits);
-        EXPECT_EQ(static_cast<int>(expected.size()), w.records);
+        EXPECT_EQ(expected.size(), w.records);
         EXPECT_TRUE(cap.contains("IMPORTANT: File system access on '" + base + "/big'"));
         EXPECT_TRUE(cap.contains("IMPORTANT: (OK) File system access on '" + base + "/big'"));
         EXPECT_TRUE(cap.contains("IMPORTANT: BUILDING CACHE SUMMARY - "));
@@ -229,7 +177,7 @@ TEST_F(QueryTest, OldCacheIsRebuiltRootByRootWithMaxCacheAgeZeroOneSecondLater)
     std::set<std::string> u = findFiles(base + "/u", "");
     expected.insert(u.begin(), u.end());
     EXPECT_EQ(expected, w.hits);
-    EXPECT_EQ(static_cast<int>(expected.size()), w.records);
+    EXPECT_EQ(expected.size(), w.records);
     EXPECT_EQ(1u, w.hits.count(base + "/t/d0/new.txt"));
     EXPECT_EQ(1u, w.hits.count(base + "/u/d1/new.txt"));
     c.close();
@@ -640,7 +588,7 @@ TEST_F(QueryTest, RebuildOnTheSameObjectAfterAnExtractionRemovesTheOldFileRows)
     std::set<std::string> u = findFiles(base + "/u", "");
     expected.insert(u.begin(), u.end());
     EXPECT_EQ(expected, w2.hits);
-    EXPECT_EQ(static_cast<int>(expected.size()), w2.records);
+    EXPECT_EQ(expected.size(), w2.records);
     EXPECT_FALSE(c.cacheUnusable);
     c.close();
 }

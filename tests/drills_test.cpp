@@ -285,7 +285,7 @@ TEST_F(DrillTest, TwoProcessesTakingTurnsThroughTheLockNeverCorruptTheCache)
             guard.unlock();
             if (rc != 0)
                 _exit(12);
-            if (w.hits != expected || w.records != static_cast<int>(expected.size()))
+            if (w.hits != expected || w.records != expected.size())
                 _exit(13);
         }
         _exit(0);

@@ -64,7 +64,7 @@ public:
     }
     int close() override { return 0; }
     std::set<std::string> hits;
-    int records = 0;
+    size_t records = 0;
 };
 
 // Regular files and links below root as find(1) lists them (NUL-separated,
