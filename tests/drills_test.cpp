@@ -186,6 +186,51 @@ TEST_F(DrillTest, ProcessKilledAfterTheQueryBeforeCloseIsNeverServed)
     EXPECT_EQ(expected, hits);
 }
 
+TEST_F(DrillTest, DeathInTheMiddleOfTheCounterAndMarkWritesIsNeverServed)
+{
+    // A death while the counter and the exclude marks are being written
+    // leaves them torn.  The same death leaves the update flag, so the torn
+    // files are never read as a valid cache: open refuses, and a rebuild
+    // answers whole.
+    makeTree(tree, 5, 4);
+    std::set<std::string> expected = testsupport::findFiles(root);
+    int how = inChild([&] {
+        FsGlue glue = testsupport::plainGlue();
+        FS_Cache c(L"dirs", L"files", widen(cache.path()).c_str(), false, true, &glue, L"prov");
+        if (c.create(0, FS_CACHE_OPEN_ALWAYS) != 0)
+            _exit(3);
+        FsQuery q;
+        q.setQuery(L"[SIZE]>=0");
+        q.addIncludePath(widen(root).c_str(), true);
+        HitWriter w;
+        if (c.executeQueryEx(w, q, 600000, LONG_AGE) != 0)
+            _exit(4);
+        raise(SIGKILL);
+    });
+    ASSERT_EQ(1000 + SIGKILL, how);
+    std::string counter = cache.path() + "/dirs.counter";
+    std::string marks = cache.path() + "/ex_hash";
+    struct stat st;
+    ASSERT_EQ(0, stat(counter.c_str(), &st));
+    ASSERT_EQ(4, st.st_size);
+    ASSERT_EQ(0, stat(marks.c_str(), &st));
+    ASSERT_GT(st.st_size, 8);
+    ASSERT_EQ(0, truncate(counter.c_str(), 2));
+    ASSERT_EQ(0, truncate(marks.c_str(), st.st_size - 5));
+
+    std::set<std::string> hits;
+    EXPECT_NE(0, query(cache.path(), root, FS_CACHE_OPEN, &hits));
+    EXPECT_TRUE(hits.empty());
+    ASSERT_EQ(0, query(cache.path(), root, FS_CACHE_OPEN_ALWAYS, &hits));
+    EXPECT_EQ(expected, hits);
+    // The rebuild wrote them whole again, and the next open serves them.
+    ASSERT_EQ(0, stat(counter.c_str(), &st));
+    EXPECT_EQ(4, st.st_size);
+    hits.clear();
+    ASSERT_EQ(0, query(cache.path(), root, FS_CACHE_OPEN, &hits));
+    EXPECT_EQ(expected, hits);
+}
+
 TEST_F(DrillTest, CompactionKilledAtEachStageLeavesACacheServedWholeOrRebuilt)
 {
     makeTree(tree, 8, 5);
