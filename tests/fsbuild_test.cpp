@@ -5,6 +5,7 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -271,6 +272,50 @@ TEST(FsBuild, TreeMatchesFindAndReverseReaddirOrder) {
     }
     // The name the C locale cannot convert is skipped with its trace.
     EXPECT_EQ(capture.count("::fs_scan - file name len is 0. file skipped!"), 1u);
+}
+
+namespace {
+
+// The walk of the fixture tree where the locked directory really can't be
+// read.  0 when everything held, else the number of the first check that
+// failed.
+int walkOverTheLockedDirectory(const Tree& tree) {
+    TraceCapture capture;
+    RecordingWriter writer;
+    FileProcessor processor(kEveryFile, true);
+    std::vector<PathInfo> includes, excludes;
+    if (walk(writer, processor, tree.root, true, includes, excludes) != 0) return 1;
+    std::set<std::string> got(writer.paths.begin(), writer.paths.end());
+    std::set<std::string> want{tree.root + "/a.txt",        tree.root + "/sub/b.txt",
+                               tree.root + "/sub/deeper/c.txt", tree.root + "/sub/deeper/d.bin",
+                               tree.root + "/linkdir",      tree.root + "/linkfile"};
+    if (got != want) return 2;
+    if (capture.count("::fs_scan - scandir error opening '" + tree.root + "/locked' path!") != 1) return 3;
+    if (!capture.contains("::scandir CAN'T OPEN " + tree.root + "/locked dir, errno: 13 (")) return 4;
+    return 0;
+}
+
+}  // namespace
+
+TEST(FsBuild, UnreadableDirectoryIsSkippedWithItsTraceAndTheWalkGoesOn) {
+    Tree tree;
+    if (!runningAsRoot()) {
+        EXPECT_EQ(walkOverTheLockedDirectory(tree), 0);
+        return;
+    }
+    // Permissions do not bind root: walk as an unprivileged user in a child.
+    ASSERT_EQ(chmod(tree.root.c_str(), 0755), 0);
+    pid_t child = fork();
+    ASSERT_NE(child, -1);
+    if (child == 0) {
+        if (setgid(65534) != 0 || setuid(65534) != 0) _exit(100);
+        _exit(walkOverTheLockedDirectory(tree));
+    }
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFEXITED(status));
+    if (WEXITSTATUS(status) == 100) GTEST_SKIP() << "cannot drop privileges";
+    EXPECT_EQ(WEXITSTATUS(status), 0);
 }
 
 TEST(FsBuild, SymbolicLinkToDirectoryIsOfferedWithItsOwnLstatData) {
@@ -582,6 +627,46 @@ std::string deepDirectory(const std::string& base, size_t length) {
 
 }  // namespace
 
+TEST(FsBuild, TreeWithPathsAroundTheLimitMatchesFindUpTo4095Characters) {
+    TempDir dir;
+    dir.write("top.txt", "t");
+    std::string at4093 = deepDirectory(dir.path(), 4093);
+    ASSERT_EQ(at4093.size(), 4093u);
+    int dirFd = open(at4093.c_str(), O_RDONLY | O_DIRECTORY);
+    ASSERT_GE(dirFd, 0);
+    for (const char* name : {"f", "gg"}) {  // full paths of 4095 and 4096 characters
+        int fd = openat(dirFd, name, O_CREAT | O_WRONLY, 0644);
+        ASSERT_GE(fd, 0);
+        close(fd);
+    }
+    // A directory of exactly 4095 characters is entered, but nothing in it fits.
+    ASSERT_EQ(mkdirat(dirFd, "h", 0755), 0);
+    int fd = openat(dirFd, "h/i", O_CREAT | O_WRONLY, 0644);
+    ASSERT_GE(fd, 0);
+    close(fd);
+    close(dirFd);
+
+    RecordingWriter writer;
+    FileProcessor processor(kEveryFile, true);
+    std::vector<PathInfo> includes, excludes;
+    EXPECT_EQ(walk(writer, processor, dir.path(), true, includes, excludes), 0);
+    std::set<std::string> fromWalk(writer.paths.begin(), writer.paths.end());
+    EXPECT_EQ(fromWalk.size(), writer.paths.size());
+
+    std::string found = testsupport::runCommand("find '" + dir.path() + "' -mindepth 1 ! -type d 2>/dev/null");
+    std::set<std::string> fromFind;
+    std::istringstream lines(found);
+    std::string line;
+    size_t seen = 0;
+    while (std::getline(lines, line)) {
+        ++seen;
+        if (line.size() <= 4095) fromFind.insert(line);
+    }
+    EXPECT_EQ(seen, 4u);  // find itself lists all four files
+    EXPECT_EQ(fromWalk, fromFind);
+    EXPECT_EQ(fromWalk, (std::set<std::string>{dir.path() + "/top.txt", at4093 + "/f"}));
+}
+
 TEST(FsScan, PathOf4095CharactersIsAcceptedAnd4096IsRefused) {
     TempDir dir;
     std::string at4095 = deepDirectory(dir.path(), 4095);
@@ -723,6 +808,67 @@ TEST(FsBuild, DfsDecisionWithABackEndLoadsTheLocalListOnceAndFollowsIt) {
     EXPECT_EQ(got, (std::set<std::string>{dir.path() + "/top.txt", dir.path() + "/outer/far.txt"}));
     EXPECT_EQ(dfs.loads, 1);
     FileSystemHelper::setBackend(nullptr);
+}
+
+namespace {
+
+// A back end whose list of local file sets cannot be loaded: every file set
+// must then be asked about on its own.
+class UnloadableDfs : public FakeDfs {
+public:
+    int load_dfs_local(char*, StringList<char>& list) override {
+        ++loads;
+        list.insert("fsLocal");  // filled, yet not to be used: the load failed
+        return 5;
+    }
+};
+
+// Runs in a fresh process, where the one load attempt has not been made yet.
+// Exits with 0 when every expectation holds, else prints what failed and
+// exits with 1.
+void walkWithUnloadableList() {
+    std::string failed;
+    {
+        TempDir dir;
+        dir.write("top.txt", "t");
+        dir.write("inner/local.txt", "l");
+        dir.write("outer/far.txt", "f");
+        UnloadableDfs dfs;
+        FileSystemHelper::setBackend(&dfs);
+        TraceCapture capture;
+        RecordingWriter writer;
+        FileProcessor processor(kEveryFile, true);
+        std::vector<PathInfo> includes, excludes;
+        walk(writer, processor, dir.path(), true, includes, excludes, kBudget, DriveInfo(L"/:", dtLocal, L"dfs"));
+        if (writer.paths != std::vector<std::string>{dir.path() + "/inner/local.txt"}) failed += "paths;";
+        if (dfs.loads != 1) failed += "loads=" + std::to_string(dfs.loads) + ";";
+        if (dfs.localQuestions != 3) failed += "questions=" + std::to_string(dfs.localQuestions) + ";";
+        if (capture.count("FS_Cache::scan - load_dfs_local_retValue value is false: dfs local list not loaded!\n") != 1)
+            failed += "not-loaded trace;";
+        if (capture.contains("value is true: dfs local list loaded!")) failed += "loaded trace;";
+        if (capture.contains("in dfs local list")) failed += "list looked up;";
+        if (!capture.contains("::fs_scan - isLocal value for '" + dir.path() + "/outer' path is false"))
+            failed += "isLocal trace;";
+        // One attempt per process: a second walk does not try again.
+        RecordingWriter again;
+        walk(again, processor, dir.path(), true, includes, excludes, kBudget, DriveInfo(L"/:", dtLocal, L"dfs"));
+        if (dfs.loads != 1) failed += "second load;";
+        if (again.paths != writer.paths) failed += "second walk;";
+        FileSystemHelper::setBackend(nullptr);
+    }
+    if (!failed.empty()) {
+        fprintf(stderr, "failed: %s\n", failed.c_str());
+        std::exit(1);
+    }
+    std::exit(0);
+}
+
+}  // namespace
+
+TEST(FsBuildDeathTest, DfsListThatFailsToLoadLeavesEveryFileSetToTheLocalQuestion) {
+    // The list is tried once per process: the child must start afresh.
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    EXPECT_EXIT(walkWithUnloadableList(), ::testing::ExitedWithCode(0), "");
 }
 
 namespace {

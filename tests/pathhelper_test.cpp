@@ -431,6 +431,25 @@ TEST(BuildExcludeList, NfsHomeIsCutFromLocalRoot) {
     EXPECT_TRUE(capture.contains("PathHelper::buildExcludeList [1] - excluded path for '/' is '/home'\n"));
 }
 
+TEST(BuildExcludeList, TracesTheLengthTestAndTheSubstringTestWhereTheyPass) {
+    testsupport::TraceCapture capture;
+    PathDrive root(L"/home", true, DriveInfo(L"/home:", dtLocal, L"ext4"));
+    EXPECT_EQ((Names{L"/home/u|r"}),
+              excludesFor({DriveInfo(L"/:", dtLocal, L"ext4"), DriveInfo(L"/home2:", dtRemote, L"nfs"),
+                           DriveInfo(L"/home/u:", dtRemote, L"nfs"), DriveInfo(L"/usr/local:", dtRemote, L"nfs")},
+                          root));
+    // "/" is not longer than the root: no length trace for it.
+    EXPECT_FALSE(capture.contains("'tmpPathLen(5)<tmpDriveLen(1)'"));
+    EXPECT_EQ(1u, capture.count("PathHelper::buildExcludeList - 'tmpPathLen(5)<tmpDriveLen(6)'\n"));
+    EXPECT_EQ(1u, capture.count("PathHelper::buildExcludeList - 'tmpPathLen(5)<tmpDriveLen(7)'\n"));
+    EXPECT_EQ(1u, capture.count("PathHelper::buildExcludeList - 'tmpPathLen(5)<tmpDriveLen(10)'\n"));
+    // Only the drive that passes both the prefix and the separator checks.
+    EXPECT_EQ(1u, capture.count(" is substring of "));
+    EXPECT_TRUE(capture.contains("PathHelper::buildExcludeList - '/home' is substring of '/home/u'\n"))
+        << capture.dump();
+    EXPECT_TRUE(capture.contains("PathHelper::buildExcludeList [1] - excluded path for '/home' is '/home/u'\n"));
+}
+
 TEST(BuildExcludeList, SameFileSystemStaysInTheWalk) {
     PathDrive root(L"/", true, DriveInfo(L"/:", dtLocal, L"ext3"));
     EXPECT_EQ(Names{}, excludesFor({DriveInfo(L"/:", dtLocal, L"ext3"), DriveInfo(L"/boot:", dtLocal, L"ext3")}, root));

@@ -488,3 +488,56 @@ TEST(PathResolverTable, FixtureDriveList) {
         EXPECT_EQ(row.roots, describe(r.roots)) << label;
     }
 }
+
+TEST(PathResolver, UnknownGroupDriveGoesToTheUnresolvedCandidates) {
+    // Mask 0 for "$foo:" means no drive is tried, so the path falls to the
+    // unresolved candidates.  Whether it is reported there depends only on
+    // the last stage: with a drive whose name is "$foo:" it is valid.
+    std::vector<DriveInfo> drives = fixtureDrives();
+    drives.push_back(DriveInfo(L"$foo:", dtLocal, L"ext4"));
+    Resolution r = resolve({PathInfo(L"$foo:/usr", false)}, 27, drives);
+    EXPECT_TRUE(r.resolved.empty());
+    EXPECT_TRUE(r.parentResolved.empty());
+    EXPECT_EQ((Names{L"$foo:/usr|n|<null>"}), describe(r.unresolved));
+    // A known group word takes the drives instead and leaves nothing unresolved.
+    Resolution known = resolve({PathInfo(L"$local:/usr", false)}, 27, drives);
+    EXPECT_TRUE(known.unresolved.empty());
+    EXPECT_FALSE(known.resolved.empty());
+}
+
+TEST(PathResolver, ListInfoIsTracedOnlyWhenLevelFourIsActive) {
+    {
+        testsupport::TraceCapture capture;
+        resolveOne(L"/usr/lib", false);
+        EXPECT_FALSE(capture.contains("PathHelper::pathResolver - list info...\n"));
+        EXPECT_FALSE(capture.contains("PathHelper::pathResolver - resolved path ["));
+    }
+    testsupport::TraceCapture capture(4);
+    std::vector<DriveInfo> drives = fixtureDrives();
+    drives.push_back(DriveInfo(L"$foo:", dtLocal, L"ext4"));
+    resolve({PathInfo(L"/usr/lib", false), PathInfo(L"$foo:/usr", true)}, 27, drives);
+    EXPECT_EQ(1u, capture.count("PathHelper::pathResolver - list info...\n")) << capture.dump();
+    EXPECT_TRUE(capture.contains("PathHelper::pathResolver - resolved path ['/usr/lib'] [2] ['/:']\n"));
+    EXPECT_TRUE(capture.contains("PathHelper::pathResolver - resolved path ['/usr/lib'] [2] ['/usr:']\n"));
+    EXPECT_TRUE(capture.contains("PathHelper::pathResolver - parent resolved path ['/usr/lib'] [2] ['/usr:']\n"));
+    EXPECT_TRUE(capture.contains("PathHelper::pathResolver - unresolved path ['$foo:/usr'] ["));
+    EXPECT_FALSE(capture.contains("PathHelper::pathResolver - excluded path ["));
+    EXPECT_EQ(1u, capture.count("PathHelper::pathResolver - list info end\n"));
+    // Every entry stands between the two marks.
+    std::vector<QvLogWrapper::Message> messages = capture.messages();
+    size_t begin = messages.size(), end = messages.size(), entries = 0, inside = 0;
+    for (size_t i = 0; i < messages.size(); ++i) {
+        if (messages[i].text == "PathHelper::pathResolver - list info...\n") begin = i;
+        if (messages[i].text == "PathHelper::pathResolver - list info end\n") end = i;
+    }
+    ASSERT_LT(begin, end);
+    for (size_t i = 0; i < messages.size(); ++i) {
+        if (messages[i].text.find("path ['") == std::string::npos ||
+            messages[i].text.find("PathHelper::pathResolver - ") != 0)
+            continue;
+        ++entries;
+        if (i > begin && i < end) ++inside;
+    }
+    EXPECT_EQ(entries, inside);
+    EXPECT_EQ(end - begin - 1, entries);
+}

@@ -196,6 +196,49 @@ TEST_F(LinuxSharedMutexTest, Wait101MakesTwoAttempts) {
     EXPECT_LT(ms, 290);
 }
 
+TEST_F(LinuxSharedMutexTest, NoAttemptFollowsTheSleepOfTheLastRound) {
+    // The holder lets go about 30 ms into the first round.  wait(1) has one
+    // round: its only attempt came before the release, so it fails although
+    // the lock is free when it returns.  wait(101) has a second attempt,
+    // after the first sleep, and takes the lock.
+    LinuxSharedMutex m("rounds");
+    {
+        LockHolder holder(dir.file("rounds"));
+        ASSERT_TRUE(holder.held);
+        auto start = std::chrono::steady_clock::now();
+        std::atomic<long long> releasedAt(-1);
+        std::thread releaser([&] {
+            std::this_thread::sleep_for(std::chrono::milliseconds(30));
+            holder.finish();
+            releasedAt = elapsedMs(start);
+        });
+        EXPECT_EQ(-20, m.wait(1));
+        long long returnedAt = elapsedMs(start);
+        releaser.join();
+        if (releasedAt.load() >= returnedAt) GTEST_SKIP() << "the release came too late to tell";
+        EXPECT_TRUE(otherProcessCanLock(dir.file("rounds")));
+    }
+    {
+        LockHolder holder(dir.file("rounds"));
+        ASSERT_TRUE(holder.held);
+        auto start = std::chrono::steady_clock::now();
+        std::atomic<long long> releasedAt(-1);
+        std::thread releaser([&] {
+            std::this_thread::sleep_for(std::chrono::milliseconds(30));
+            holder.finish();
+            releasedAt = elapsedMs(start);
+        });
+        int result = m.wait(101);
+        long long ms = elapsedMs(start);
+        releaser.join();
+        if (releasedAt.load() >= 90) GTEST_SKIP() << "the release came too late to tell";
+        EXPECT_EQ(0, result);
+        EXPECT_GE(ms, 95);  // taken at the second attempt, after one sleep
+        EXPECT_FALSE(otherProcessCanLock(dir.file("rounds")));
+        EXPECT_EQ(0, m.release());
+    }
+}
+
 TEST_F(LinuxSharedMutexTest, LockComesFreeWhenTheHoldingProcessDies) {
     LinuxSharedMutex m("dies");
     LockHolder holder(dir.file("dies"));

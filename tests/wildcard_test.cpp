@@ -3,6 +3,7 @@
 
 #include <clocale>
 #include <cstring>
+#include <cwctype>
 #include <string>
 #include <vector>
 
@@ -52,6 +53,108 @@ TEST(MatchWildcard, EmptyTextAndNullAreRefusedCleanly) {
     EXPECT_FALSE(matchWildcard(L"*a*?", L"a"));
     EXPECT_FALSE(matchWildcard<wchar_t>(nullptr, L"a"));
     EXPECT_FALSE(matchWildcard<wchar_t>(L"a", nullptr));
+}
+
+namespace {
+
+// The matcher's steps, one by one, with one remembered position.  The steps
+// can run the text past its end in two places; there the answer is the one a
+// clean stop gives: a "?" that finds the end fails, and mask and text ending
+// together match.
+bool stepByStep(const std::string& maskText, const std::string& textText) {
+    const char* mask = maskText.c_str();
+    const char* text = textText.c_str();
+    long m = 0, t = 0, restartMask = -1, restartText = -1;
+step1:
+    if (mask[m] == '*') {
+        while (mask[m] == '*') ++m;
+        if (mask[m] == 0) return true;
+        restartMask = m;
+        restartText = t;
+        if (mask[m] == '?') {
+            if (text[t] == 0) return false;
+        } else {
+            while (text[t] != mask[m]) {
+                if (text[t] == 0) return false;
+                ++t;
+                restartText = t;
+            }
+        }
+        goto step3;
+    }
+step2: {
+        char c = mask[m], d = text[t];
+        if (d == 0 && c == '?') return false;
+        if (d == 0 && c == 0) return true;
+        if (c == d || c == '?') goto step3;
+        if (restartMask < 0) return false;
+        if (m == restartMask) {
+            if (d == 0) return false;
+            ++t;
+            goto step1;
+        }
+        if (d == mask[restartMask]) {
+            m = restartMask + 1;
+            if (d == 0) return false;
+            ++t;
+            goto step1;
+        }
+        if (text[restartText] == 0) return false;
+        ++restartText;
+        t = restartText;
+        m = restartMask;
+        goto step2;
+    }
+step3:
+    ++m;
+    ++t;
+    if (text[t] == 0) {
+        while (mask[m] == '*') ++m;
+        return mask[m] == 0;
+    }
+    goto step1;
+}
+
+}  // namespace
+
+TEST(MatchWildcard, AgreesWithTheStepsOnEveryShortMaskAndText) {
+    // Every mask of up to five characters over "a", "b", "*", "?" against
+    // every text of one to six characters over "a", "b", in both widths.
+    const char alphabet[] = "ab*?";
+    size_t compared = 0, disagreements = 0, matches = 0;
+    for (int maskLength = 0; maskLength <= 5; ++maskLength) {
+        long maskCount = 1;
+        for (int i = 0; i < maskLength; ++i) maskCount *= 4;
+        for (long mi = 0; mi < maskCount; ++mi) {
+            std::string mask;
+            for (long x = mi, i = 0; i < maskLength; ++i, x /= 4) mask += alphabet[x % 4];
+            const std::wstring wideMask(mask.begin(), mask.end());
+            for (int textLength = 1; textLength <= 6; ++textLength) {
+                for (long ti = 0; ti < (1L << textLength); ++ti) {
+                    std::string text;
+                    for (int i = 0; i < textLength; ++i) text += ((ti >> i) & 1) ? 'b' : 'a';
+                    const std::wstring wideText(text.begin(), text.end());
+                    const bool expected = stepByStep(mask, text);
+                    const bool narrow = matchWildcard(mask.c_str(), text.c_str());
+                    const bool wide = matchWildcard(wideMask.c_str(), wideText.c_str());
+                    ++compared;
+                    if (expected) ++matches;
+                    if (narrow != expected || wide != expected) {
+                        if (++disagreements <= 10)
+                            ADD_FAILURE() << "mask '" << mask << "' text '" << text << "': steps " << expected
+                                          << ", narrow " << narrow << ", wide " << wide;
+                    }
+                }
+            }
+        }
+    }
+    EXPECT_EQ(0u, disagreements);
+    EXPECT_EQ(1365u * 126u, compared);
+    EXPECT_GT(matches, 0u);
+    EXPECT_LT(matches, compared);
+    // Where the steps would take a "?" past the end of the text, no match.
+    EXPECT_FALSE(matchWildcard("*a?", "aaa"));
+    EXPECT_TRUE(matchWildcard("*a?", "aab"));
 }
 
 TEST(MatchWildcard, StringObjectsAndIgnoreCaseLowerInPlace) {
@@ -104,6 +207,78 @@ TEST(WildCmp, GlobWithBacktracking) {
     EXPECT_FALSE(wildvccmp(L"A?C", L"abc", true));
 }
 
+namespace {
+
+// The glob steps: characters one by one until the first "*"; then at each
+// "*" remember the pattern behind it and the text one further, and on a
+// mismatch go back there, moving the text on by one.
+bool globSteps(const wchar_t* pattern, const wchar_t* text, bool prefixOk, bool foldCase) {
+    auto same = [foldCase](wchar_t a, wchar_t b) { return foldCase ? towlower(a) == towlower(b) : a == b; };
+    const wchar_t* rememberedPattern = nullptr;
+    const wchar_t* rememberedText = nullptr;
+    while (*text != 0 && *pattern != L'*') {
+        if (!same(*pattern, *text) && *pattern != L'?') return false;
+        ++pattern;
+        ++text;
+    }
+    while (*text != 0) {
+        if (*pattern == L'*') {
+            if (*++pattern == 0) return true;
+            rememberedPattern = pattern;
+            rememberedText = text + 1;
+        } else if (same(*pattern, *text) || *pattern == L'?') {
+            ++pattern;
+            ++text;
+        } else {
+            pattern = rememberedPattern;
+            text = rememberedText++;
+        }
+    }
+    while (*pattern == L'*') ++pattern;
+    return *pattern == 0 || prefixOk;
+}
+
+}  // namespace
+
+TEST(WildCmp, AgreesWithTheGlobStepsOnEveryShortPatternAndText) {
+    // Patterns of up to five characters over "a", "B", "*", "?"; texts of up
+    // to six characters over "A", "b"; both prefix modes; both case twins.
+    const wchar_t alphabet[] = L"aB*?";
+    size_t compared = 0, disagreements = 0, caseOnly = 0;
+    for (int patternLength = 0; patternLength <= 5; ++patternLength) {
+        long patternCount = 1;
+        for (int i = 0; i < patternLength; ++i) patternCount *= 4;
+        for (long pi = 0; pi < patternCount; ++pi) {
+            std::wstring pattern;
+            for (long x = pi, i = 0; i < patternLength; ++i, x /= 4) pattern += alphabet[x % 4];
+            for (int textLength = 0; textLength <= 6; ++textLength) {
+                for (long ti = 0; ti < (1L << textLength); ++ti) {
+                    std::wstring text;
+                    for (int i = 0; i < textLength; ++i) text += ((ti >> i) & 1) ? L'b' : L'A';
+                    for (bool prefixOk : {false, true}) {
+                        const bool exact = globSteps(pattern.c_str(), text.c_str(), prefixOk, false);
+                        const bool folded = globSteps(pattern.c_str(), text.c_str(), prefixOk, true);
+                        const bool gotExact = wildcmp(pattern.c_str(), text.c_str(), prefixOk);
+                        const bool gotFolded = wildcasecmp(pattern.c_str(), text.c_str(), prefixOk);
+                        compared += 2;
+                        if (folded && !exact) ++caseOnly;
+                        if (gotExact != exact || gotFolded != folded) {
+                            if (++disagreements <= 10)
+                                ADD_FAILURE() << "pattern '" << std::string(pattern.begin(), pattern.end())
+                                              << "' text '" << std::string(text.begin(), text.end())
+                                              << "' prefixOk " << prefixOk << ": steps " << exact << "/" << folded
+                                              << ", got " << gotExact << "/" << gotFolded;
+                        }
+                    }
+                }
+            }
+        }
+    }
+    EXPECT_EQ(0u, disagreements);
+    EXPECT_EQ(1365u * 127u * 4u, compared);
+    EXPECT_GT(caseOnly, 0u);  // the case twins do differ somewhere
+}
+
 TEST(WildPathCmp, NonRecursivePatternDoesNotMatchTrailingSeparator) {
     EXPECT_FALSE(wildpathcmp(L"/usr", L"/usr/", false));
     EXPECT_TRUE(wildpathcmp(L"/usr", L"/usr/", true));
@@ -139,6 +314,93 @@ TEST(WildPathCmp, StarsCrossSeparatorsAndCaseTwin) {
     EXPECT_TRUE(wildcasepathcmp(L"/HOME/*", L"/home/a", false));
     EXPECT_TRUE(wildvcpathcmp(L"/HOME", L"/home/a", true, false));
     EXPECT_FALSE(wildvcpathcmp(L"/HOME", L"/home/a", true, true));
+}
+
+namespace {
+
+// The path rules: the glob steps, where a mismatch with the pattern at its end
+// may still match at a separator, and a text that ends before the pattern may
+// match a pattern that goes on with only "/" or "/*".
+bool pathSteps(const wchar_t* pattern, const wchar_t* text, bool recursive, bool foldCase) {
+    auto same = [foldCase](wchar_t a, wchar_t b) { return foldCase ? towlower(a) == towlower(b) : a == b; };
+    const wchar_t* const textStart = text;
+    const wchar_t* rememberedPattern = nullptr;
+    const wchar_t* rememberedText = nullptr;
+    while (*text != 0 && *pattern != L'*') {
+        if (*pattern != 0 && (same(*pattern, *text) || *pattern == L'?')) {
+            ++pattern;
+            ++text;
+            continue;
+        }
+        if (*pattern != 0 || !recursive) return false;
+        return *text == L'/' || (text > textStart && text[-1] == L'/');
+    }
+    while (*text != 0) {
+        if (*pattern == L'*') {
+            if (*++pattern == 0) return true;
+            rememberedPattern = pattern;
+            rememberedText = text + 1;
+        } else if (*pattern != 0 && (same(*pattern, *text) || *pattern == L'?')) {
+            ++pattern;
+            ++text;
+        } else {
+            if (*pattern == 0 && *text == L'/' && (recursive || text[1] == 0)) return true;
+            pattern = rememberedPattern;
+            text = rememberedText++;
+        }
+    }
+    bool skipped = false;
+    while (*pattern == L'*') {
+        ++pattern;
+        skipped = true;
+    }
+    if (*pattern == 0) return true;
+    if (skipped) return false;
+    return *pattern == L'/' && (pattern[1] == 0 || (pattern[1] == L'*' && pattern[2] == 0));
+}
+
+}  // namespace
+
+TEST(WildPathCmp, AgreesWithThePathRulesOnEveryShortPatternAndText) {
+    // Patterns of up to five characters over "a", "/", "*", "?"; texts of up
+    // to five characters over "a", "A", "/"; both recursive modes; both twins.
+    const wchar_t patternAlphabet[] = L"a/*?";
+    const wchar_t textAlphabet[] = L"aA/";
+    size_t compared = 0, disagreements = 0, matches = 0;
+    for (int patternLength = 0; patternLength <= 5; ++patternLength) {
+        long patternCount = 1;
+        for (int i = 0; i < patternLength; ++i) patternCount *= 4;
+        for (long pi = 0; pi < patternCount; ++pi) {
+            std::wstring pattern;
+            for (long x = pi, i = 0; i < patternLength; ++i, x /= 4) pattern += patternAlphabet[x % 4];
+            for (int textLength = 0; textLength <= 5; ++textLength) {
+                long textCount = 1;
+                for (int i = 0; i < textLength; ++i) textCount *= 3;
+                for (long ti = 0; ti < textCount; ++ti) {
+                    std::wstring text;
+                    for (long x = ti, i = 0; i < textLength; ++i, x /= 3) text += textAlphabet[x % 3];
+                    for (bool recursive : {false, true}) {
+                        const bool exact = pathSteps(pattern.c_str(), text.c_str(), recursive, false);
+                        const bool folded = pathSteps(pattern.c_str(), text.c_str(), recursive, true);
+                        const bool gotExact = wildpathcmp(pattern.c_str(), text.c_str(), recursive);
+                        const bool gotFolded = wildcasepathcmp(pattern.c_str(), text.c_str(), recursive);
+                        compared += 2;
+                        if (exact) ++matches;
+                        if (gotExact != exact || gotFolded != folded) {
+                            if (++disagreements <= 10)
+                                ADD_FAILURE() << "pattern '" << std::string(pattern.begin(), pattern.end())
+                                              << "' text '" << std::string(text.begin(), text.end())
+                                              << "' recursive " << recursive << ": rules " << exact << "/"
+                                              << folded << ", got " << gotExact << "/" << gotFolded;
+                        }
+                    }
+                }
+            }
+        }
+    }
+    EXPECT_EQ(0u, disagreements);
+    EXPECT_EQ(1365u * 364u * 4u, compared);
+    EXPECT_GT(matches, 0u);
 }
 
 TEST(WideStrings, CheckWildCardAndCaseComparisons) {

@@ -90,8 +90,11 @@ bool dfsAddRecord(QvLogWrapper* log, const char* narrow, DriveType driveType) {
             }
             dfsLocalListPending = false;
         }
-        if (!dfsLocalListLoaded) isLocal = helper.dfs_local(fset, helper.dfs_hname()) != 0;
-        if (isLocal) {
+        // Without the list every file set is asked about on its own; with it,
+        // only a file set found in the list is asked.
+        if (!dfsLocalListLoaded) {
+            isLocal = helper.dfs_local(fset, helper.dfs_hname()) != 0;
+        } else {
             if (dfsLocalList->find(fset) >= 0) {
                 isLocal = helper.dfs_local(fset, helper.dfs_hname()) != 0;
                 log->traceMAX(__LINE__, __FILE__, __FUNCTION__,
