@@ -393,3 +393,68 @@ TEST(CriteriaHashTest, TextColumnAgainstAWildcardMakesNoCandidate) {
     EXPECT_STREQ(L"xyz", info->getStringValue());
     EXPECT_EQ(EXP_STRING, info->getType());
 }
+
+TEST(CriteriaExample, SetSizeAndAttributeExpressionOverChangingFields) {
+    Fields fields;
+    fields.add(L"FILENAME", FIELD_TEXT);
+    fields.add(L"SIZE", FIELD_INT64);
+    fields.add(L"ATTR", FIELD_INT32);
+    CriteriaEvaluator evaluator(L"[FILENAME]=={\"*.so\",\"lib*.a\"} && [SIZE]>1024 || [ATTR]&1==0");
+    ASSERT_TRUE(evaluator.setFields(&fields));
+    // The set and the disjunction leave nothing for an index to look up.
+    EXPECT_EQ(nullptr, evaluator.getHashInfo());
+    struct Row {
+        const wchar_t* name;
+        unsigned long long size;
+        unsigned int attr;
+        int expected;
+    } rows[] = {
+        {L"libc.so", 2048, 1, 1},    // in the set, big
+        {L"libc.so", 1024, 1, 0},    // in the set, not above 1024
+        {L"libz.a", 5000, 1, 1},     // "lib*.a"
+        {L"z.a", 5000, 1, 0},        // not "lib*.a"
+        {L"libz.ar", 5000, 1, 0},    // "lib*.a" must end in ".a"
+        {L"LIBZ.A", 5000, 1, 0},     // sets compare with case
+        {L"x.so.1", 5000, 1, 0},     // "*.so" must end the name
+        {L".so", 5000, 1, 1},        // the tail alone
+        {L"notes.txt", 10, 0, 1},    // attribute bit 0 clear
+        {L"notes.txt", 10, 2, 1},
+        {L"notes.txt", 10, 3, 0},
+        {L"libc.so", 10, 0, 1},
+        {L"libc.so", 0x100000000ULL, 1, 1},
+    };
+    for (const Row& row : rows) {
+        static_cast<TextField*>(fields.name(L"FILENAME"))->value(row.name);
+        static_cast<Int64Field*>(fields.name(L"SIZE"))->value(row.size);
+        static_cast<Int32Field*>(fields.name(L"ATTR"))->value(row.attr);
+        std::wstring wide(row.name);
+        EXPECT_EQ(row.expected, evaluator.check(true))
+            << std::string(wide.begin(), wide.end()) << " " << row.size << " " << row.attr;
+        EXPECT_FALSE(evaluator.hasFailed());
+    }
+    // The first pass over the text gives the same answers as the walks.
+    for (const Row& row : rows) {
+        CriteriaEvaluator fresh(evaluator.getCriteria());
+        ASSERT_TRUE(fresh.setFields(&fields));
+        static_cast<TextField*>(fields.name(L"FILENAME"))->value(row.name);
+        static_cast<Int64Field*>(fields.name(L"SIZE"))->value(row.size);
+        static_cast<Int32Field*>(fields.name(L"ATTR"))->value(row.attr);
+        EXPECT_EQ(row.expected, fresh.check(true));
+    }
+}
+
+TEST_F(CriteriaTest, HashPassSetsHashOnlyJustAroundItsParse) {
+    CriteriaEvaluator evaluator(L"[A]==1 && count(2)==2");
+    CountCommand count;
+    ASSERT_TRUE(evaluator.addCmd(L"count", 0, 0, &count));
+    ASSERT_TRUE(evaluator.setFields(&fields));
+    ASSERT_NE(nullptr, evaluator.getAnalyzer());
+    EXPECT_FALSE(evaluator.getAnalyzer()->getHashOnly());
+    ExpValue* info = evaluator.getHashInfo();
+    ASSERT_NE(nullptr, info);
+    EXPECT_STREQ(L"A", info->getNValueString());
+    EXPECT_EQ(0, count.calls);
+    EXPECT_FALSE(evaluator.getAnalyzer()->getHashOnly());
+    EXPECT_EQ(1, evaluator.check(true));
+    EXPECT_EQ(1, count.calls);
+}

@@ -261,6 +261,27 @@ const std::vector<Row>& table() {
         N(L"[NAME]=={\"REPORT.TXT\"}", 0, false),
         N(L"{\"*.txt\"}==[NAME]", 0),
         N(L"\"b\"=={\"a\",\"b\"}", 1),
+        N(L"vname=={\"a*\",\"b\"}", 1),
+        N(L"vname=={\"b\",\"a*\"}", 1),
+        N(L"\"b\"=={\"a*\",\"b\"}", 1),
+        N(L"\"c\"=={\"a*\",\"b\"}", 0),
+        N(L"\"c\"!={\"a*\",\"b\"}", 1),
+        // only quoted masks enter a set: unquoted text is ignored
+        N(L"vname=={a*,b}", 0),
+        N(L"\"b\"=={a*,b}", 0),
+        N(L"vname!={abc}", 1),
+        // the masks of a set: a lone star at either end may match nothing
+        N(L"vname=={\"*abc\"}", 1),
+        N(L"vname=={\"abc*\"}", 1),
+        N(L"vname=={\"*bc\"}", 1),
+        N(L"vname=={\"*b\"}", 0),
+        N(L"vname=={\"a?c\"}", 1),
+        N(L"vname=={\"*b*\"}", 1),
+        N(L"vname=={\"a?\"}", 0),
+        N(L"vname=={\"\",\"abc\"}", 1),
+        N(L"vname=={\"\"}", 0),
+        // a set on the left is only its text
+        N(L"{\"a*\",\"b\"}==\"b\"", 0),
         N(L"[NAME]=={\"*.txt\"}&&[SIZE]>1", 1),
         N(L"[NAME]=={\"*.doc\"}||[SIZE]>1", 1),
         // commands of one and two arguments
@@ -341,6 +362,11 @@ const std::vector<Row>& table() {
         F(L"nope==1", "SyntaxAnalyzer::factor - variable specified not found!\n"),
         F(L"[var1]==5", "SyntaxAnalyzer::factor - variable specified not found!\n"),
         F(L"[HEX]==1", "SyntaxTree::l_value - field type 6 not supported\n"),
+        // names of fields, variables and commands compare exactly, whatever the case flag
+        Row{L"[name]==\"report.txt\"", false, FAIL, 0, nullptr,
+            "SyntaxAnalyzer::factor - variable specified not found!\n"},
+        Row{L"VAR1==5", false, FAIL, 0, nullptr, "SyntaxAnalyzer::factor - variable specified not found!\n"},
+        Row{L"TWICE(1)==2", false, FAIL, 0, nullptr, "SyntaxAnalyzer::factor - variable specified not found!\n"},
         // commands used wrongly
         F(L"twice(\"a\")", "SyntaxAnalyzer::factor - command[twice]: parameter type mismatch!\n"),
         F(L"add(\"a\",1)", "SyntaxAnalyzer::factor - command[add]: first parameter type mismatch!\n"),

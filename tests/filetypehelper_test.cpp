@@ -9,6 +9,7 @@
 #include <gtest/gtest.h>
 
 #include <fcntl.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -782,6 +783,108 @@ TEST_F(FileTypeCheckerTest, BlankInANameOfTheDirectoryIsSplitByXargs) {
     // blank is never answered by the batch.
     EXPECT_FALSE(checker.getFileTypeEx(W(spaced).c_str(), &line));
     EXPECT_EQ(nullptr, line);
+}
+
+// ---- a shell that cannot be started ----------------------------------------
+
+namespace {
+
+// Takes every free file descriptor below a lowered limit but leaveFree of
+// them, so that a pipe can't be made while it lives.
+class DescriptorsExhausted {
+public:
+    explicit DescriptorsExhausted(int leaveFree) {
+        if (getrlimit(RLIMIT_NOFILE, &saved_) != 0) return;
+        struct rlimit low = saved_;
+        if (low.rlim_cur == RLIM_INFINITY || low.rlim_cur > 256) low.rlim_cur = 256;
+        if (setrlimit(RLIMIT_NOFILE, &low) != 0) return;
+        lowered_ = true;
+        for (;;) {
+            int fd = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
+            if (fd < 0) break;
+            fillers_.push_back(fd);
+        }
+        for (int i = 0; i < leaveFree && !fillers_.empty(); ++i) {
+            ::close(fillers_.back());
+            fillers_.pop_back();
+        }
+    }
+    ~DescriptorsExhausted() { release(); }
+    void release() {
+        for (int fd : fillers_) ::close(fd);
+        fillers_.clear();
+        if (lowered_) setrlimit(RLIMIT_NOFILE, &saved_);
+        lowered_ = false;
+    }
+    bool ok() const { return lowered_ && !fillers_.empty(); }
+
+private:
+    struct rlimit saved_;
+    bool lowered_ = false;
+    std::vector<int> fillers_;
+};
+
+}  // namespace
+
+TEST_F(FileTypeCheckerTest, ShellThatCannotStartEndsAsFalseWithATrace) {
+    TempDir dir;
+    std::string a = dir.write("a.txt", "words\n");
+    dir.write("b.txt", "words\n");
+    StringList<wchar_t> text, include, exclude;
+    text.insert(L"text");
+    include.insert(L"text");
+    TraceCapture capture;
+    wchar_t* one = nullptr;
+    wchar_t* batch = nullptr;
+    bool oneResult, batchResult, typedResult, singleResult;
+    {
+        DescriptorsExhausted exhausted(0);
+        ASSERT_TRUE(exhausted.ok());
+        oneResult = checker.getFileType(W(a).c_str(), &one);
+        singleResult = checker.check(W(dir.path()).c_str(), L"a.txt", include, exclude);
+    }
+    {
+        // The batch opens its directory first: one descriptor for that.
+        DescriptorsExhausted exhausted(1);
+        ASSERT_TRUE(exhausted.ok());
+        batchResult = checker.getFileTypeEx(W(a).c_str(), &batch);
+        typedResult = checker.check(W(dir.file("b.txt")).c_str(), text);
+    }
+    EXPECT_FALSE(oneResult);
+    EXPECT_FALSE(batchResult);
+    EXPECT_FALSE(typedResult);
+    EXPECT_FALSE(singleResult);
+    EXPECT_EQ(nullptr, one);
+    EXPECT_EQ(nullptr, batch);
+    EXPECT_TRUE(capture.contains("FileTypeChecker::check - cannot open 'LANG=C; export LANG; file \"" + a +
+                                 "\" 2>/dev/null' cmd file!\n"))
+        << capture.dump();
+    EXPECT_TRUE(capture.contains("FileTypeChecker::check - cannot open 'cd \"" + dir.path() +
+                                 "\";LANG=C; export LANG; ls | xargs file 2> /dev/null' cmd file!\n"))
+        << capture.dump();
+    EXPECT_EQ(4u, capture.count("' cmd file!\n")) << capture.dump();
+    EXPECT_EQ(0u, FileTypeChecker::batchCache().size());
+}
+
+TEST_F(FileTypeCheckerTest, ListCheckWhoseShellCannotStartGivesNoResult) {
+    TempDir work;
+    std::string list = work.write("paths", work.path() + "/x\n");
+    StringList<wchar_t> include, exclude;
+    include.insert(L"text");
+    std::vector<bool> results;
+    TraceCapture capture;
+    int count;
+    {
+        // One descriptor for the list file, none for the pipe.
+        DescriptorsExhausted exhausted(1);
+        ASSERT_TRUE(exhausted.ok());
+        count = checker.check(W(list).c_str(), include, exclude, results);
+    }
+    EXPECT_EQ(-1, count);
+    EXPECT_TRUE(results.empty());
+    EXPECT_TRUE(capture.contains("FileTypeChecker::check - cannot open 'LANG=C; export LANG; file -f " + list +
+                                 " 2>/dev/null' cmd file!\n"))
+        << capture.dump();
 }
 
 // ---- the list file ---------------------------------------------------------

@@ -356,3 +356,48 @@ TEST(FsTokenTest, CopyIsDeep) {
     assigned = assigned;
     EXPECT_EQ(heapText, assigned.getStringValue());
 }
+
+TEST_F(LexerTest, NumberValueComesFromItsFirstTwentyThreeDigits) {
+    // Digits behind the 23rd are part of the token but not of its value.
+    std::wstring seven = std::wstring(22, L'0') + L"7" + L"999";
+    EXPECT_EQ((std::vector<std::string>{"0:7:", "err1"}), lexAll(lexer, seven.c_str()));
+    std::wstring twentyThree = std::wstring(20, L'0') + L"123";
+    EXPECT_EQ((std::vector<std::string>{"0:123:", "err1"}), lexAll(lexer, twentyThree.c_str()));
+}
+
+TEST_F(LexerTest, VeryLongNumberIsOneTokenAndIsReadSafely) {
+    std::wstring zeros = std::wstring(5000, L'0') + L"1";
+    EXPECT_EQ((std::vector<std::string>{"0:0:", "4:0:", "0:2:", "err1"}),
+              lexAll(lexer, (zeros + L"+2").c_str()));
+    std::wstring big = L"1" + std::wstring(5000, L'0');
+    EXPECT_EQ((std::vector<std::string>{"0:9223372036854775807:", "err1"}), lexAll(lexer, big.c_str()));
+    std::wstring fraction = L"." + std::wstring(5000, L'5');
+    EXPECT_EQ((std::vector<std::string>{"0:0:", "err1"}), lexAll(lexer, fraction.c_str()));
+}
+
+TEST_F(LexerTest, OneDotLeavesThePositionAtTheLiteral) {
+    lexer.setExpression(L"2 + 1.");
+    EXPECT_EQ(0, lexer.nextToken().type);
+    EXPECT_EQ(4, lexer.nextToken().type);
+    EXPECT_EQ(255, lexer.nextToken().type);
+    EXPECT_EQ(2, lexer.getLastError());
+    // Nothing was consumed: asking again meets the same "1.", not the ".".
+    fsToken again = lexer.nextToken();
+    EXPECT_EQ(255, again.type);
+    EXPECT_EQ(2, lexer.getLastError());
+    EXPECT_EQ(0u, again.numericValue);
+}
+
+TEST_F(LexerTest, UnterminatedStringAndSetStopAtTheirOpeningMark) {
+    for (const wchar_t* text : {L"1 == \"abc", L"[A] == {\"abc\""}) {
+        lexer.setExpression(text);
+        lexer.nextToken();
+        EXPECT_EQ(7, lexer.nextToken().type);
+        EXPECT_EQ(255, lexer.nextToken().type);
+        EXPECT_EQ(2, lexer.getLastError());
+        // The position stays at the quote or brace: what follows it is never
+        // read as a token of its own.
+        EXPECT_EQ(255, lexer.nextToken().type);
+        EXPECT_EQ(2, lexer.getLastError());
+    }
+}

@@ -2,6 +2,7 @@
 // of simple expressions, and failures that must end cleanly.
 #include <gtest/gtest.h>
 
+#include <cwchar>
 #include <string>
 
 #include "fscanner/fscommon/expvalue.h"
@@ -639,4 +640,98 @@ TEST_F(SyntaxAnalyzerTest, WalkWithAVariableOfAnotherTypeLeavesTheRelationAlone)
     EXPECT_EQ(1u, result.number);
     EXPECT_FALSE(analyzer.parse(nullptr, &text, result, true));
     EXPECT_EQ(0u, result.number);
+}
+
+// ---------------------------------------------------------------- bad input leaves no state behind
+
+TEST_F(SyntaxAnalyzerTest, CommandWithAnUnsupportedArgumentCountFails) {
+    SyntaxAnalyzer analyzer;
+    CountCommand count;
+    // addCmdToken only makes commands of one or two arguments; a table entry
+    // of any other count can only be put there by hand.
+    CmdToken odd;
+    wcscpy(odd.name, L"odd");
+    odd.argumentCount = 3;
+    odd.returnType = 0;
+    odd.argumentTypes = {0, 0, 0};
+    odd.command.unary = &count;
+    cmdTokenTable().push_back(odd);
+    ExpValue result;
+    result.setNumericValue(31);
+    testsupport::TraceCapture capture;
+    EXPECT_TRUE(analyzer.parse(L"odd(1)", &fields, nullptr, result, true));
+    EXPECT_TRUE(capture.contains("SyntaxAnalyzer::factor - command specified (odd) n_args not supported!\n"))
+        << capture.dump();
+    EXPECT_EQ(1u, capture.messages().size()) << capture.dump();
+    EXPECT_EQ(0, count.calls);
+    EXPECT_EQ(31u, result.number);
+    cmdTokenTable().clear();
+}
+
+TEST_F(SyntaxAnalyzerTest, FailedParseLeavesNoStateForTheNextOne) {
+    SyntaxAnalyzer analyzer;
+    CountCommand count;
+    ASSERT_TRUE(analyzer.addCmdToken(L"count", 0, 0, &count));
+    ExpValue candidate;
+    // Each of these fails after a candidate was found, inside a disjunction,
+    // or with commands half parsed.
+    const wchar_t* broken[] = {L"[A]==1 && (",          L"[A]==1 || [B]==",
+                               L"[A]==1 || count(\"x\")", L"[B]==2 && !([A]==",
+                               L"\"abc",                  L"[A]==1 ",
+                               L"1\t+ 2",                 L"[NOPE]==1",
+                               L"count(1,2)",             L"{\"a\""};
+    for (const wchar_t* text : broken) {
+        std::wstring wide(text);
+        std::string label(wide.begin(), wide.end());
+        ExpValue result;
+        EXPECT_TRUE(analyzer.parse(text, &fields, nullptr, result, true)) << label;
+        EXPECT_TRUE(analyzer.getError()) << label;
+
+        // The same analyzer then parses a good expression as a new one would.
+        setA(1);
+        ASSERT_FALSE(analyzer.parse(L"[B]==0 && [A]==1", &fields, nullptr, result, true)) << label;
+        EXPECT_FALSE(analyzer.getError()) << label;
+        EXPECT_EQ(1u, result.number) << label;
+        EXPECT_TRUE(analyzer.isSimple()) << label;
+        EXPECT_EQ(0u, analyzer.getOrDepth()) << label;
+        ASSERT_TRUE(analyzer.getHashValue(candidate)) << label;
+        EXPECT_STREQ(L"B", candidate.getNValueString()) << label;
+        EXPECT_EQ(0u, candidate.number) << label;
+        // The tree is that of the good expression alone.
+        TreeNode* root = analyzer.getTree()->getRoot();
+        ASSERT_NE(nullptr, root) << label;
+        EXPECT_EQ(6, root->token.type) << label;
+        EXPECT_EQ(0u, root->token.numericValue) << label;
+        EXPECT_TRUE(analyzer.getTree()->preVisit(root)) << label;
+        setA(2);
+        ExpValue walked;
+        ASSERT_FALSE(analyzer.parse(&fields, nullptr, walked, true)) << label;
+        EXPECT_EQ(0u, walked.number) << label;
+    }
+    EXPECT_EQ(0, count.calls);
+}
+
+TEST_F(SyntaxAnalyzerTest, LongestStringLiteralIsParsedAndWalked) {
+    // 4194303 characters is the most a literal may hold.
+    std::wstring longest(4194303, L'x');
+    static_cast<TextField*>(fields.name(L"S"))->value(longest.c_str());
+    SyntaxAnalyzer analyzer;
+    ExpValue result;
+    std::wstring text = L"[S]==\"" + longest + L"\"";
+    ASSERT_FALSE(analyzer.parse(text.c_str(), &fields, nullptr, result, true));
+    EXPECT_EQ(1u, result.number);
+    ExpValue candidate;
+    ASSERT_TRUE(analyzer.getHashValue(candidate));
+    EXPECT_EQ(4194303u, candidate.getStringLength());
+    static_cast<TextField*>(fields.name(L"S"))->value(L"short");
+    ExpValue walked;
+    ASSERT_FALSE(analyzer.parse(&fields, nullptr, walked, true));
+    EXPECT_EQ(0u, walked.number);
+
+    std::wstring alone = L"\"" + longest + L"\"";
+    ASSERT_FALSE(analyzer.parse(alone.c_str(), &fields, nullptr, result, true));
+    EXPECT_EQ(EXP_STRING, result.getType());
+    EXPECT_EQ(4194303u, result.getStringLength());
+    ASSERT_FALSE(analyzer.parse(&fields, nullptr, walked, true));
+    EXPECT_EQ(4194303u, walked.getStringLength());
 }
