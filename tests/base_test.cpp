@@ -227,3 +227,23 @@ TEST(Tracing, FormatterHandlesWidthsPrecisionAndPercent) {
     EXPECT_EQ(QvLogWrapper::format("%S", none), "(null)");
     EXPECT_EQ(QvLogWrapper::format("%0.1f%%", 50.0), "50.0%");
 }
+
+TEST(KelmFailAfter, ServesTheGivenNumberOfRequestsThenFailsUntilEnded) {
+    kelm_failAfter(2);
+    void* a = kelm_malloc(8);
+    void* b = kelm_realloc(a, 64);
+    ASSERT_NE(nullptr, a);
+    ASSERT_NE(nullptr, b);
+    EXPECT_EQ(nullptr, kelm_malloc(8));
+    // A failed realloc leaves the old block valid and untouched.
+    std::memset(b, 'x', 64);
+    EXPECT_EQ(nullptr, kelm_realloc(b, 128));
+    EXPECT_EQ('x', static_cast<char*>(b)[63]);
+    EXPECT_EQ(nullptr, i_strdup("text"));
+    kelm_failAfter(-1);
+    char* copy = i_strdup("text");
+    ASSERT_NE(nullptr, copy);
+    EXPECT_STREQ("text", copy);
+    kelm_free(copy);
+    kelm_free(b);
+}

@@ -866,6 +866,27 @@ TEST_F(FileTypeCheckerTest, ShellThatCannotStartEndsAsFalseWithATrace) {
     EXPECT_EQ(0u, FileTypeChecker::batchCache().size());
 }
 
+// Out of memory for the command text: nothing runs, the answer is false and
+// the trace says why.  The check by directory and name fails one step
+// earlier, on the copy of the full path, and runs nothing either.
+TEST_F(FileTypeCheckerTest, CommandTextThatCannotBeAllocatedEndsAsFalseWithATrace) {
+    TempDir dir;
+    std::string a = dir.write("a.txt", "words\n");
+    StringList<wchar_t> include, exclude;
+    include.insert(L"text");
+    TraceCapture capture;
+    wchar_t* one = nullptr;
+    kelm_failAfter(0);
+    bool oneResult = checker.getFileType(W(a).c_str(), &one);
+    bool singleResult = checker.check(W(dir.path()).c_str(), L"a.txt", include, exclude);
+    kelm_failAfter(-1);
+    EXPECT_FALSE(oneResult);
+    EXPECT_FALSE(singleResult);
+    EXPECT_EQ(nullptr, one);
+    EXPECT_EQ(1u, capture.count("FileTypeChecker::check - 'cmd' malloc failed!\n")) << capture.dump();
+    EXPECT_FALSE(capture.contains("running '")) << capture.dump();
+}
+
 TEST_F(FileTypeCheckerTest, ListCheckWhoseShellCannotStartGivesNoResult) {
     TempDir work;
     std::string list = work.write("paths", work.path() + "/x\n");

@@ -207,6 +207,66 @@ TEST(Scandir, MissingDirectoryFailsWithTrace) {
         << capture.dump();
 }
 
+namespace {
+
+// Descriptors this process has open, from /proc/self/fd.
+int openDescriptors() {
+    int n = 0;
+    DIR* d = opendir("/proc/self/fd");
+    if (d == nullptr) return -1;
+    while (readdir(d) != nullptr) ++n;
+    closedir(d);
+    return n;
+}
+
+}  // namespace
+
+// Out of memory while the list grows: the first growth fails, so there is
+// no list at all; the handle is closed all the same.
+TEST(Scandir, ListThatCannotGrowFailsWithTraceAndClosesTheDirectory) {
+    TempDir dir;
+    dir.write("a", "");
+    int before = openDescriptors();
+    TraceCapture capture;
+    dirent** list = nullptr;
+    kelm_failAfter(0);
+    int n = scandir(dir.path().c_str(), &list);
+    kelm_failAfter(-1);
+    EXPECT_EQ(-1, n);
+    EXPECT_EQ(nullptr, list);
+    EXPECT_TRUE(capture.contains("::scandir - *namelist == NULL!\n")) << capture.dump();
+    EXPECT_FALSE(capture.contains("(*namelist)[i] == NULL!"));
+    EXPECT_EQ(before, openDescriptors());
+}
+
+// Out of memory for the copy of the second entry: the list keeps the first
+// entry (the caller owns it), the slot grown for the second holds nothing
+// that was handed out, and the handle is closed.
+TEST(Scandir, EntryThatCannotBeCopiedFailsWithTraceAndKeepsTheEntriesSoFar) {
+    TempDir dir;
+    dir.write("a", "");
+    dir.write("b", "");
+    std::vector<std::string> order;
+    DIR* d = opendir(dir.path().c_str());
+    while (struct dirent* e = readdir(d)) order.push_back(e->d_name);
+    closedir(d);
+    ASSERT_EQ(4u, order.size());
+    int before = openDescriptors();
+    TraceCapture capture;
+    dirent** list = nullptr;
+    kelm_failAfter(3);  // grow, copy, grow; the second copy fails
+    int n = scandir(dir.path().c_str(), &list);
+    kelm_failAfter(-1);
+    EXPECT_EQ(-1, n);
+    ASSERT_NE(nullptr, list);
+    EXPECT_STREQ(order[0].c_str(), list[0]->d_name);
+    EXPECT_TRUE(capture.contains("::scandir - (*namelist)[i] == NULL!\n")) << capture.dump();
+    EXPECT_FALSE(capture.contains("*namelist == NULL!\n"));
+    EXPECT_EQ(before, openDescriptors());
+    kelm_free(list[0]);
+    kelm_free(list);
+}
+
 // ---------------------------------------------------------- fs_isValidPath
 
 TEST(FsIsValidPath, OnlyRealDirectoriesPass) {

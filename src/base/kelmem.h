@@ -22,4 +22,10 @@ void* kelm_realloc(void* block, size_t size);
 // Copies a NUL-terminated text into a block from kelm_malloc.  Null gives null.
 char* i_strdup(const char* text);
 
+// Out-of-memory drill for tests.  After `allocations` more requests of
+// kelm_malloc or kelm_realloc have been served, every further request fails
+// (null, the old block of a realloc untouched) until the drill is ended by a
+// negative value, which is also the default: never fail.  Process-wide.
+void kelm_failAfter(long allocations);
+
 #endif
