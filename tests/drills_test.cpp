@@ -85,6 +85,25 @@ int inChild(Body body)
     return WEXITSTATUS(status);
 }
 
+// A child builds the cache over root, answers the query, and dies by SIGKILL
+// before the cache is closed; gives how the child ended (see inChild).
+int queryThenDie(const std::string& cacheDir, const std::string& root)
+{
+    return inChild([&] {
+        FsGlue glue = testsupport::plainGlue();
+        FS_Cache c(L"dirs", L"files", widen(cacheDir).c_str(), false, true, &glue, L"prov");
+        if (c.create(0, FS_CACHE_OPEN_ALWAYS) != 0)
+            _exit(3);
+        FsQuery q;
+        q.setQuery(L"[SIZE]>=0");
+        q.addIncludePath(widen(root).c_str(), true);
+        HitWriter w;
+        if (c.executeQueryEx(w, q, 600000, LONG_AGE) != 0)
+            _exit(4);
+        raise(SIGKILL);
+    });
+}
+
 int scanCalls = 0;
 int killAtScan = 0;
 void killOnScan(char const*)
@@ -166,19 +185,7 @@ TEST_F(DrillTest, ProcessKilledAfterTheQueryBeforeCloseIsNeverServed)
     // the flag.
     makeTree(tree, 5, 4);
     std::set<std::string> expected = testsupport::findFiles(root);
-    int how = inChild([&] {
-        FsGlue glue = testsupport::plainGlue();
-        FS_Cache c(L"dirs", L"files", widen(cache.path()).c_str(), false, true, &glue, L"prov");
-        if (c.create(0, FS_CACHE_OPEN_ALWAYS) != 0)
-            _exit(3);
-        FsQuery q;
-        q.setQuery(L"[SIZE]>=0");
-        q.addIncludePath(widen(root).c_str(), true);
-        HitWriter w;
-        if (c.executeQueryEx(w, q, 600000, LONG_AGE) != 0)
-            _exit(4);
-        raise(SIGKILL);
-    });
+    int how = queryThenDie(cache.path(), root);
     ASSERT_EQ(1000 + SIGKILL, how);
     EXPECT_NE(0, query(cache.path(), root, FS_CACHE_OPEN, nullptr));
     std::set<std::string> hits;
@@ -194,19 +201,7 @@ TEST_F(DrillTest, DeathInTheMiddleOfTheCounterAndMarkWritesIsNeverServed)
     // answers whole.
     makeTree(tree, 5, 4);
     std::set<std::string> expected = testsupport::findFiles(root);
-    int how = inChild([&] {
-        FsGlue glue = testsupport::plainGlue();
-        FS_Cache c(L"dirs", L"files", widen(cache.path()).c_str(), false, true, &glue, L"prov");
-        if (c.create(0, FS_CACHE_OPEN_ALWAYS) != 0)
-            _exit(3);
-        FsQuery q;
-        q.setQuery(L"[SIZE]>=0");
-        q.addIncludePath(widen(root).c_str(), true);
-        HitWriter w;
-        if (c.executeQueryEx(w, q, 600000, LONG_AGE) != 0)
-            _exit(4);
-        raise(SIGKILL);
-    });
+    int how = queryThenDie(cache.path(), root);
     ASSERT_EQ(1000 + SIGKILL, how);
     std::string counter = cache.path() + "/dirs.counter";
     std::string marks = cache.path() + "/ex_hash";

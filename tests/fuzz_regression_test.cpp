@@ -41,6 +41,17 @@ protected:
         dir.write("t.pxx", pxx);
     }
 
+    // The index list of "t" names one index "i" over field "A"; `idx` is the
+    // whole of its file.
+    void writeIndexOnA(const std::string& idx) {
+        const unsigned char list[] = {110, 0, 0, 0, 4, 0, 0, 0, 'i', 0, 0, 0, 4, 0, 0, 0, 'A', 0, 0, 0};
+        dir.write("t_idx.dat", bytes(list, sizeof list));
+        dir.write("i.idx", idx);
+    }
+
+    // 65536 buckets, every one empty.
+    static std::string emptyBuckets() { return std::string(65536 * 8, '\xff'); }
+
     testsupport::TempDir dir;
     testsupport::TempDir locks;
     char savedStore[sizeof LinuxSharedMutex::storePath];
@@ -134,10 +145,8 @@ TEST_F(DamagedTableTest, IndexChainLoopOverRemovedRecordsEndsTheLookup) {
                                  0x00, 7, 0, 0, 0, 0x00, 8, 0, 0, 0};
     const unsigned char pxx[] = {24, 0, 0, 0, 0, 0, 0, 0};
     writeTable(bytes(dat, sizeof dat), bytes(pxx, sizeof pxx));
-    const unsigned char list[] = {110, 0, 0, 0, 4, 0, 0, 0, 'i', 0, 0, 0, 4, 0, 0, 0, 'A', 0, 0, 0};
-    dir.write("t_idx.dat", bytes(list, sizeof list));
     const unsigned char loop[] = {1, 0, 0, 0, 0x00, 0x00, 0x01, 0x00};  // slot 65536: record 1, next 65536
-    dir.write("i.idx", std::string(65536 * 8, '\xff') + bytes(loop, sizeof loop));
+    writeIndexOnA(emptyBuckets() + bytes(loop, sizeof loop));
 
     FS_Table table(L"t", widen(dir.path()).c_str(), false);
     ASSERT_TRUE(table.open());
@@ -162,11 +171,9 @@ TEST_F(DamagedTableTest, IndexChainThroughARemovedRecordStillFindsTheLiveOne) {
                                  0x00, 7, 0, 0, 0, 0x00, 8, 0, 0, 0};
     const unsigned char pxx[] = {24, 0, 0, 0, 0, 0, 0, 0};
     writeTable(bytes(dat, sizeof dat), bytes(pxx, sizeof pxx));
-    const unsigned char list[] = {110, 0, 0, 0, 4, 0, 0, 0, 'i', 0, 0, 0, 4, 0, 0, 0, 'A', 0, 0, 0};
-    dir.write("t_idx.dat", bytes(list, sizeof list));
     // slot 65536: record 0, end; slot 65537: record 1, next 65536.
     const unsigned char chain[] = {0, 0, 0, 0, 0xff, 0xff, 0xff, 0xff, 1, 0, 0, 0, 0x00, 0x00, 0x01, 0x00};
-    dir.write("i.idx", std::string(65536 * 8, '\xff') + bytes(chain, sizeof chain));
+    writeIndexOnA(emptyBuckets() + bytes(chain, sizeof chain));
 
     FS_Table table(L"t", widen(dir.path()).c_str(), false);
     ASSERT_TRUE(table.open());
@@ -188,10 +195,8 @@ TEST_F(DamagedTableTest, IndexChainLinkThatClimbsEndsTheChain) {
                                  0x00, 7, 0, 0, 0, 0x00, 8, 0, 0, 0};
     const unsigned char pxx[] = {24, 0, 0, 0, 29, 0, 0, 0};
     writeTable(bytes(dat, sizeof dat), bytes(pxx, sizeof pxx));
-    const unsigned char list[] = {110, 0, 0, 0, 4, 0, 0, 0, 'i', 0, 0, 0, 4, 0, 0, 0, 'A', 0, 0, 0};
-    dir.write("t_idx.dat", bytes(list, sizeof list));
     const unsigned char ring[] = {0, 0, 0, 0, 0x01, 0x00, 0x01, 0x00, 1, 0, 0, 0, 0x00, 0x00, 0x01, 0x00};
-    dir.write("i.idx", std::string(65536 * 8, '\xff') + bytes(ring, sizeof ring));
+    writeIndexOnA(emptyBuckets() + bytes(ring, sizeof ring));
 
     FS_Table table(L"t", widen(dir.path()).c_str(), false);
     ASSERT_TRUE(table.open());
@@ -217,14 +222,12 @@ TEST_F(DamagedTableTest, CursorOverAnIndexRingStops) {
                                  0x00, 7, 0, 0, 0, 0x00, 7, 0, 0, 0};
     const unsigned char pxx[] = {24, 0, 0, 0, 29, 0, 0, 0};
     writeTable(bytes(dat, sizeof dat), bytes(pxx, sizeof pxx));
-    const unsigned char list[] = {110, 0, 0, 0, 4, 0, 0, 0, 'i', 0, 0, 0, 4, 0, 0, 0, 'A', 0, 0, 0};
-    dir.write("t_idx.dat", bytes(list, sizeof list));
-    std::string idx(65536 * 8, '\xff');
+    std::string idx = emptyBuckets();
     const unsigned char bucket[] = {0, 0, 0, 0, 0x00, 0x00, 0x01, 0x00};  // record 0, next 65536
     idx.replace(2035 * 8, 8, bytes(bucket, sizeof bucket));
     const unsigned char ring[] = {1, 0, 0, 0, 0x01, 0x00, 0x01, 0x00,   // 65536: record 1, next 65537
                                   0, 0, 0, 0, 0x00, 0x00, 0x01, 0x00};  // 65537: record 0, next 65536
-    dir.write("i.idx", idx + bytes(ring, sizeof ring));
+    writeIndexOnA(idx + bytes(ring, sizeof ring));
 
     FS_Table table(L"t", widen(dir.path()).c_str(), false);
     ASSERT_TRUE(table.open());
@@ -250,13 +253,11 @@ TEST_F(DamagedTableTest, IndexChainIntoTheBucketsEndsTheChain) {
                                  0x00, 7, 0, 0, 0};
     const unsigned char pxx[] = {24, 0, 0, 0};
     writeTable(bytes(dat, sizeof dat), bytes(pxx, sizeof pxx));
-    const unsigned char list[] = {110, 0, 0, 0, 4, 0, 0, 0, 'i', 0, 0, 0, 4, 0, 0, 0, 'A', 0, 0, 0};
-    dir.write("t_idx.dat", bytes(list, sizeof list));
-    std::string idx(65536 * 8, '\xff');
+    std::string idx = emptyBuckets();
     // Bucket 5 holds record 0 and leads to bucket 5 again.
     const unsigned char bucket[] = {0, 0, 0, 0, 5, 0, 0, 0};
     idx.replace(5 * 8, 8, bytes(bucket, sizeof bucket));
-    dir.write("i.idx", idx);
+    writeIndexOnA(idx);
 
     FS_Table table(L"t", widen(dir.path()).c_str(), false);
     ASSERT_TRUE(table.open());

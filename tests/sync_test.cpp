@@ -202,16 +202,21 @@ TEST_F(LinuxSharedMutexTest, NoAttemptFollowsTheSleepOfTheLastRound) {
     // the lock is free when it returns.  wait(101) has a second attempt,
     // after the first sleep, and takes the lock.
     LinuxSharedMutex m("rounds");
+    // Lets the holder go about 30 ms after start and notes when it did.
+    auto releaseAfter30ms = [](LockHolder& holder, std::chrono::steady_clock::time_point start,
+                               std::atomic<long long>& releasedAt) {
+        return std::thread([&holder, start, &releasedAt] {
+            std::this_thread::sleep_for(std::chrono::milliseconds(30));
+            holder.finish();
+            releasedAt = elapsedMs(start);
+        });
+    };
     {
         LockHolder holder(dir.file("rounds"));
         ASSERT_TRUE(holder.held);
         auto start = std::chrono::steady_clock::now();
         std::atomic<long long> releasedAt(-1);
-        std::thread releaser([&] {
-            std::this_thread::sleep_for(std::chrono::milliseconds(30));
-            holder.finish();
-            releasedAt = elapsedMs(start);
-        });
+        std::thread releaser = releaseAfter30ms(holder, start, releasedAt);
         EXPECT_EQ(-20, m.wait(1));
         long long returnedAt = elapsedMs(start);
         releaser.join();
@@ -223,11 +228,7 @@ TEST_F(LinuxSharedMutexTest, NoAttemptFollowsTheSleepOfTheLastRound) {
         ASSERT_TRUE(holder.held);
         auto start = std::chrono::steady_clock::now();
         std::atomic<long long> releasedAt(-1);
-        std::thread releaser([&] {
-            std::this_thread::sleep_for(std::chrono::milliseconds(30));
-            holder.finish();
-            releasedAt = elapsedMs(start);
-        });
+        std::thread releaser = releaseAfter30ms(holder, start, releasedAt);
         int result = m.wait(101);
         long long ms = elapsedMs(start);
         releaser.join();
