@@ -73,11 +73,9 @@ ToolRun runTool(const testsupport::TempDir& dir, const std::vector<std::string>&
             setenv(e.substr(0, eq).c_str(), e.substr(eq + 1).c_str(), 1);
         }
         if (!cwd.empty() && chdir(cwd.c_str()) != 0) _exit(99);
-        std::vector<char*> argv;
-        argv.push_back(const_cast<char*>(kTool.c_str()));
-        for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
-        argv.push_back(nullptr);
-        execv(kTool.c_str(), argv.data());
+        std::vector<std::string> argv{kTool};
+        argv.insert(argv.end(), args.begin(), args.end());
+        testsupport::execBuildProgram(argv);
         _exit(98);
     }
     ToolRun run;
@@ -713,7 +711,7 @@ TEST_F(FsQueryTool, LeftOverUpdateFlagOfACrashedRunIsRecoveredFrom) {
 
 TEST_F(FsQueryTool, ClosedOutputPipeEndsQuietlyAndClosesTheCache) {
     for (int i = 0; i < 3000; ++i) dir.write("tree/many/file" + std::to_string(i) + ".dat", "");
-    std::string script = dir.write("pipe.sh", "'" + kTool + "' --mount-table '" + mtab + "' --cache '" +
+    std::string script = dir.write("pipe.sh", testsupport::emulatorPrefix() + "'" + kTool + "' --mount-table '" + mtab + "' --cache '" +
                                                   cache + "' '" + tree +
                                                   "' | head -n 1 >/dev/null\necho \"status=${PIPESTATUS[0]}\"\n");
     std::string out = testsupport::runCommand("bash '" + script + "'");
@@ -789,11 +787,9 @@ TEST_F(FsQueryTool, ProgressShowsOnATerminalForALongScan) {
         dup2(tty, 2);
         close(master);
         setenv("HOME", dir.file("home").c_str(), 1);
-        std::vector<char*> argv;
-        argv.push_back(const_cast<char*>(kTool.c_str()));
-        for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
-        argv.push_back(nullptr);
-        execv(kTool.c_str(), argv.data());
+        std::vector<std::string> argv{kTool};
+        argv.insert(argv.end(), args.begin(), args.end());
+        testsupport::execBuildProgram(argv);
         _exit(98);
     }
     std::string terminal;

@@ -114,4 +114,44 @@ std::string runCommand(const std::string& command, int* status) {
     return out;
 }
 
+namespace {
+
+std::vector<std::string> emulatorWords() {
+    std::vector<std::string> words;
+    const char* emulator = std::getenv("FSCANNER_TEST_EMULATOR");
+    if (emulator == nullptr) return words;
+    std::string word;
+    for (const char* c = emulator;; ++c) {
+        if (*c == ' ' || *c == '\0') {
+            if (!word.empty()) words.push_back(word);
+            word.clear();
+            if (*c == '\0') break;
+        } else {
+            word += *c;
+        }
+    }
+    return words;
+}
+
+}  // namespace
+
+void execBuildProgram(const std::vector<std::string>& argv) {
+    std::vector<std::string> words = emulatorWords();
+    words.insert(words.end(), argv.begin(), argv.end());
+    if (words.empty()) return;
+    std::vector<char*> raw;
+    for (std::string& w : words) raw.push_back(const_cast<char*>(w.c_str()));
+    raw.push_back(nullptr);
+    if (words.size() > argv.size())
+        execvp(raw[0], raw.data());
+    else
+        execv(raw[0], raw.data());
+}
+
+std::string emulatorPrefix() {
+    std::string prefix;
+    for (const std::string& w : emulatorWords()) prefix += w + " ";
+    return prefix;
+}
+
 }  // namespace testsupport

@@ -53,6 +53,17 @@ public:
 // Runs a shell command and gives its standard output.
 std::string runCommand(const std::string& command, int* status = nullptr);
 
+// Replaces the calling process (a forked child) with a program of the build:
+// argv[0] is the program's path.  When FSCANNER_TEST_EMULATOR names an
+// emulator (for example "qemu-i386 -L /", set by CTest in a 32-bit build
+// whose programs this machine cannot run itself), the program runs under it.
+// Returns only when the exec failed.
+void execBuildProgram(const std::vector<std::string>& argv);
+
+// The prefix for a shell command that starts a program of the build: the
+// emulator's words and a space, or "" when none is set.
+std::string emulatorPrefix();
+
 }  // namespace testsupport
 
 #endif

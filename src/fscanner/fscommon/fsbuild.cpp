@@ -16,6 +16,12 @@
 #include "fscanner/fscommon/utils.h"
 #include "fscanner/fscommon/wildcard.h"
 
+// The walk reads directories and file status with large-file support: without
+// it the 32-bit C library fails readdir and lstat with EOVERFLOW on 64-bit
+// inode numbers, directory offsets and sizes of 2 GiB or more, and whole
+// directories would drop out of every answer.
+static_assert(sizeof(off_t) == 8 && sizeof(ino_t) == 8, "the library is built with _FILE_OFFSET_BITS=64");
+
 namespace {
 
 // Longest path the walk accepts, in wide characters.

@@ -204,6 +204,18 @@ bool fs_isValidPath(wchar_t* path);
 // entry at all).  Each entry is a kelm_malloc copy of d_reclen bytes; the
 // caller releases each entry and the array with kelm_free.  On an allocation
 // failure the entries kept so far stay allocated and *namelist holds them.
+//
+// The entries have the layout of `dirent` with large-file support, which the
+// library is built with: on 32-bit targets a caller must compile with
+// _FILE_OFFSET_BITS=64 (the CMake package and pkg-config file carry it), or
+// its `dirent` has other offsets than the entries it is given.  Such a caller
+// gets a compile error at its call instead of misread entries.
+#if defined(__SIZEOF_POINTER__) && __SIZEOF_POINTER__ == 4 && \
+    (!defined(_FILE_OFFSET_BITS) || _FILE_OFFSET_BITS != 64)
+int scandir(const char* path, dirent*** namelist)
+    __attribute__((error("scandir(path, namelist) needs _FILE_OFFSET_BITS=64 on this target")));
+#else
 int scandir(const char* path, dirent*** namelist);
+#endif
 
 #endif

@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <climits>
 #include <cstdlib>
 #include <cstring>
 #include <cwchar>
@@ -90,10 +91,14 @@ bool StdFile::eof() { return feof(stream) != 0; }
 
 bool StdFile::size(unsigned int* result) {
     if (stream == nullptr) return false;
-    long here = ftell(stream);
-    fseek(stream, 0, SEEK_END);
-    *result = static_cast<unsigned int>(ftell(stream));
-    fseek(stream, here, SEEK_SET);
+    // 64-bit offsets, so that a file past what `long` or the 32-bit result
+    // can hold is refused instead of reported as its size modulo 4 GiB.
+    off_t here = ftello(stream);
+    fseeko(stream, 0, SEEK_END);
+    off_t end = ftello(stream);
+    fseeko(stream, here, SEEK_SET);
+    if (end < 0 || static_cast<unsigned long long>(end) > 0xFFFFFFFFull) return false;
+    *result = static_cast<unsigned int>(end);
     return true;
 }
 
@@ -128,7 +133,13 @@ bool LinuxMmFile::open() {
     if (d == -1) return false;
     fd = d;
     unsigned int onDisk = 0;
-    if (!size(&onDisk)) return false;
+    if (!size(&onDisk)) {
+        // Not one of ours (too long to describe): left as it is, not cut to
+        // a logical size of 0 by a later close.
+        ::close(fd);
+        fd = -1;
+        return false;
+    }
     logical = onDisk;
     allocated = onDisk;
     position = 0;
@@ -141,6 +152,9 @@ bool LinuxMmFile::size(unsigned int* result) {
     if (fd == -1 || name == nullptr) return false;
     struct stat st;
     if (stat(name, &st) != 0) return false;
+    // A mapped file's sizes are 32-bit words; a longer file is not one of
+    // ours and is refused rather than read as its size modulo 4 GiB.
+    if (st.st_size < 0 || static_cast<unsigned long long>(st.st_size) > 0xFFFFFFFFull) return false;
     *result = static_cast<unsigned int>(st.st_size);
     return true;
 }
@@ -206,7 +220,11 @@ bool LinuxMmFile::addChunk(unsigned int length) {
     if (!unMapFile() && allocated != 0) return false;
     unsigned long long grown =
         static_cast<unsigned long long>(allocated) + CHUNK + (length & 0xFF000000u);
-    if (grown > 0xFFFFFFFFull) return false;  // past what a 32-bit size can describe
+    // Past what a 32-bit size can describe, or, where `long` is 32 bits,
+    // past what tell() and seek() can: the write fails instead of wrapping.
+    const unsigned long long limit =
+        sizeof(long) < 8 ? static_cast<unsigned long long>(LONG_MAX) : 0xFFFFFFFFull;
+    if (grown > limit) return false;
     uint32_t newAllocated = static_cast<uint32_t>(grown);
     if (lseek(fd, static_cast<off_t>(newAllocated) - 1, SEEK_SET) == static_cast<off_t>(-1)) return false;
     char zero = 0;
