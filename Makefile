@@ -88,3 +88,15 @@ test32:
 	$(CMAKE) --build $(TEST32_BUILD) -j $(JOBS)
 	file $(TEST32_BUILD)/libfscanner.so* $(TEST32_BUILD)/fsquery | grep -q 'ELF 32-bit'
 	cd $(TEST32_BUILD) && ctest --output-on-failure -j $(JOBS) $(TEST32_CTEST_ARGS)
+
+# `make install PREFIX=/some/where` (default /usr/local): library, headers,
+# CMake package, pkg-config file, fsquery with its man page and completion.
+# `make package`: Debian packages fscanner and fscanner-dev in $(BUILD).
+PREFIX ?= /usr/local
+.PHONY: install package
+install: build
+	$(CMAKE) --install $(BUILD) --prefix $(PREFIX)
+
+package: build
+	cd $(BUILD) && cpack -G DEB
+	@ls -1 $(BUILD)/*.deb
