@@ -735,7 +735,8 @@ private:
     // computes the ones asked for.
     void computeSums(FsFileInfo& info) {
         if (info.getPath() == nullptr || info.getName() == nullptr) return;
-        if (info.getAttr() & (FsFileInfo::ATTR_SYMLINK | FsFileInfo::ATTR_DIRECTORY)) return;
+        // Only a regular file is read: a pipe would block, a device may never end.
+        if ((info.getAttr() & FsFileInfo::ATTR_REGULAR) == 0) return;
         FileChecksumInfo sums;
         if (options.md5) sums.flags |= FILE_CHECKSUM_MD5;
         if (options.crc32) sums.flags |= FILE_CHECKSUM_CRC32;
@@ -744,7 +745,7 @@ private:
         appendLocal(full, info.getPath());
         if (!full.empty() && full.back() != '/') full.push_back('/');
         appendLocal(full, info.getName());
-        if (computeFileChecksumInfo(sums, full.c_str()) != 0) return;
+        if (computeRegularFileChecksumInfo(sums, full.c_str()) != 0) return;
         if (options.md5) {
             wchar_t text[MD5_TEXT_SIZE];
             md52wchar_t(sums.md5, text);

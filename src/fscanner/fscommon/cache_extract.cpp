@@ -193,10 +193,13 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
                 info.valid = true;
             } else if ((files.getFieldAsInt32(L"ATTR") & LINK_ATTRIBUTE) == 0) {
                 // A link is never opened: it keeps zero sums and find decides.
+                // The row's ATTR has no bit for a pipe or a socket, so the
+                // open itself refuses anything that is not a regular file by
+                // then: such a file counts as unreadable.
                 char narrow[EXTRACT_NARROW_BYTES];
                 narrowFilePath(directoryWithSeparator, files.getFieldAsString(L"FILENAME"), narrow,
                                sizeof(narrow));
-                if (narrow[0] != '\0' && computeFileChecksumInfo(info, narrow) != 0) {
+                if (narrow[0] != '\0' && computeRegularFileChecksumInfo(info, narrow) != 0) {
                     // A file that cannot be read counts as having zero sums.
                     info.crc32 = 0;
                     info.q32 = 0;

@@ -317,11 +317,12 @@ int FS_CacheBase::scan(FsQuery const& query, PathDrive& path, RecordSet& directo
                 } else {
                     FileChecksumInfo sums;
                     sums.flags = FILE_CHECKSUM_CRC32 | FILE_CHECKSUM_Q32 | FILE_CHECKSUM_MD5;
-                    // A link is never opened: its sums stay zero.
-                    if ((attr & FsFileInfo::ATTR_SYMLINK) == 0) {
+                    // Only a regular file is opened: a link, a pipe or a
+                    // device keeps zero sums.
+                    if ((attr & FsFileInfo::ATTR_REGULAR) != 0) {
                         std::vector<char> narrowFile(SCAN_NARROW_PATH_BYTES);
                         if (narrowFilePath(prefix, wideNameBuffer, narrowFile.data()))
-                            computeFileChecksumInfo(sums, narrowFile.data());
+                            computeRegularFileChecksumInfo(sums, narrowFile.data());
                     }
                     wchar_t md5Text[MD5_TEXT_SIZE];
                     md52wchar_t(sums.md5, md5Text);

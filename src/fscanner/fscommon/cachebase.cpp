@@ -12,6 +12,7 @@
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
 #include "fscanner/fscommon/cache_common.h"
+#include "fscanner/fscommon/cachetables.h"
 #include "fscanner/fscommon/checksum.h"
 #include "fscanner/fscommon/drivehelper.h"
 #include "fscanner/fscommon/fsbuild.h"
@@ -70,6 +71,16 @@ void digestName(wchar_t const* name, unsigned char (&digest)[16])
     md5_init(&ctx);
     md5_update(&ctx, buffer, strlen(buffer));
     md5_final(&ctx, digest);
+}
+
+// The first of the two tables whose guard found damage, or null.
+FS_Table* damagedTable(FS_Table* files, FS_Table* directories)
+{
+    if (files != nullptr && files->isDamaged())
+        return files;
+    if (directories != nullptr && directories->isDamaged())
+        return directories;
+    return nullptr;
 }
 
 }  // namespace
@@ -340,6 +351,9 @@ bool FS_CacheBase::createCache()
     beginCacheUpdate();
     cacheUnusable = false;
     openCursors();
+    // Arms the tables' guards for the rows this object writes and reads.
+    tbFiles->verify();
+    tbDirectories->verify();
     // New tables hand out ids from 1 again: nothing remembered still holds.
     clearPathMemo();
     directoriesIndex = 0;
@@ -380,6 +394,18 @@ bool FS_CacheBase::openCache()
     beginCacheUpdate();
     cacheUnusable = false;
     openCursors();
+    // The files carry no checksum; what they say of each other is checked
+    // here and, by the tables' guards, at every read.  A damaged cache opens
+    // latched: queries answer -40 and close removes it for a rebuild.
+    std::wstring damagedFile;
+    char const* failedCheck = nullptr;
+    if (!cachetables::checkCacheTables(tbDirectories, tbFiles, directoriesIndex, &damagedFile,
+                                       &failedCheck)) {
+        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - damaged cache file '%ls': %s",
+                      className, __func__, damagedFile.c_str(),
+                      failedCheck != nullptr ? failedCheck : "");
+        cacheUnusable = true;
+    }
     log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - cache opened!", className, __func__);
     return true;
 }
@@ -850,6 +876,13 @@ int FS_CacheBase::executeQueryEx(FsResultSetWriter& writer, FsQuery const& query
         return CACHE_UNUSABLE;
     unsigned int indexBefore = directoriesIndex;
     int result = executeQueryCacheOnlyEx(writer, query, timeout, maxCacheAge);
+    // A read that met damage ended its walk early: what the writer got is
+    // not the answer, whatever the flow returned.
+    if (FS_Table* damaged = damagedTable(tbFiles, tbDirectories)) {
+        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - damaged cache file '%ls': %s",
+                      className, __func__, damaged->damagedFile(), damaged->damagedCheck());
+        result = CACHE_UNUSABLE;
+    }
     if (result == CACHE_UNUSABLE || result == BUILD_TIMED_OUT) {
         cacheUnusable = true;
         return result;

@@ -1,5 +1,6 @@
 #include "fscanner/fscommon/cachetables.h"
 
+#include <algorithm>
 #include <cwchar>
 #include <string>
 #include <vector>
@@ -70,7 +71,109 @@ bool createTable(FS_Table** slot, wchar_t const* name, wchar_t const* dir, bool 
     return true;
 }
 
+// The table has the columns and types given, in order, and every index it
+// lists is one of those given, under its own name, once.
+bool sameLayout(FS_Table* table, wchar_t const* const* columns, unsigned int const* types,
+                unsigned int count, wchar_t const* const* indexes, unsigned int indexCount,
+                std::wstring* file, char const** check)
+{
+    Fields& schema = table->getFields();
+    *file = table->getDataPath();
+    if (schema.count() != count) {
+        *check = "data file header does not hold the cache's columns";
+        return false;
+    }
+    for (unsigned int i = 0; i < count; ++i) {
+        Field* field = schema.at(i);
+        if (field->getName() == nullptr || wcscmp(field->getName(), columns[i]) != 0 ||
+            field->getType() != types[i]) {
+            *check = "data file header does not hold the cache's columns";
+            return false;
+        }
+    }
+    std::vector<bool> seen(indexCount, false);
+    for (Index* index : table->getIndexes()) {
+        bool known = false;
+        for (unsigned int i = 0; i < indexCount && !known; ++i) {
+            std::wstring indexName = std::wstring(table->getName()) + L"_" + indexes[i];
+            if (index->getIndexName() != nullptr && index->getFieldName() != nullptr &&
+                indexName == index->getIndexName() && wcscmp(index->getFieldName(), indexes[i]) == 0 &&
+                !seen[i]) {
+                seen[i] = true;
+                known = true;
+            }
+        }
+        if (!known) {
+            *file = std::wstring(table->getDirectory()) + table->getIndexListName();
+            *check = "index list names an index the cache does not make";
+            return false;
+        }
+    }
+    return true;
+}
+
 }  // namespace
+
+bool cachetables::checkCacheTables(FS_Table* directories, FS_Table* files, unsigned int counter,
+                                   std::wstring* file, char const** check)
+{
+    if (directories == nullptr || files == nullptr)
+        return true;
+    struct Entry {
+        FS_Table* table;
+        wchar_t const* const* columns;
+        unsigned int const* types;
+        unsigned int count;
+        wchar_t const* const* indexes;
+        unsigned int indexCount;
+    } const tables[2] = {{directories, directoryColumns, directoryTypes, DIRECTORY_COLUMNS,
+                          directoryIndexes, 3},
+                         {files, fileColumns, fileTypes, FILE_COLUMNS, fileIndexes, 2}};
+    for (Entry const& t : tables) {
+        if (!sameLayout(t.table, t.columns, t.types, t.count, t.indexes, t.indexCount, file,
+                        check))
+            return false;
+        if (!t.table->verify()) {
+            *file = t.table->damagedFile() != nullptr ? t.table->damagedFile() : L"";
+            *check = t.table->damagedCheck() != nullptr ? t.table->damagedCheck() : "table is not open";
+            return false;
+        }
+    }
+
+    // Every directory row, through the guarded reads.
+    std::vector<std::pair<unsigned int, unsigned int>> rows;  // id, parent id
+    RecordSet set = directories->openRecordSet();
+    for (bool row = set.moveFirst(); row; row = set.moveNext())
+        rows.emplace_back(set.getFieldAsInt32(L"ID"), set.getFieldAsInt32(L"PARENTID"));
+    directories->closeRecordSet(set);
+    if (directories->isDamaged()) {
+        *file = directories->damagedFile();
+        *check = directories->damagedCheck();
+        return false;
+    }
+    *file = directories->getDataPath();
+    std::vector<unsigned int> ids;
+    ids.reserve(rows.size());
+    for (auto const& r : rows) {
+        if (r.first == 0 || r.first > counter) {
+            *check = "directory id outside the ids the counter has given";
+            return false;
+        }
+        ids.push_back(r.first);
+    }
+    std::sort(ids.begin(), ids.end());
+    if (std::adjacent_find(ids.begin(), ids.end()) != ids.end()) {
+        *check = "two directory rows have one id";
+        return false;
+    }
+    for (auto const& r : rows) {
+        if (r.second != 0 && !std::binary_search(ids.begin(), ids.end(), r.second)) {
+            *check = "directory row names a parent that does not exist";
+            return false;
+        }
+    }
+    return true;
+}
 
 bool FS_CacheBase::createDirectoriesTable(FS_Table** slot, wchar_t const* name)
 {

@@ -13,10 +13,13 @@
 #ifndef FSCANNER_FSCOMMON_CACHETABLES_H
 #define FSCANNER_FSCOMMON_CACHETABLES_H
 
+#include <string>
+
 #include "fscanner/fscommon/expvalue.h"
 #include "fscanner/fscommon/filetypehelper.h"
 
 class FS_CacheBase;
+class FS_Table;
 
 namespace cachetables {
 const unsigned int TYPE_INT32 = 3;
@@ -46,6 +49,17 @@ const unsigned int PATH_CHARS = 4096;
 const unsigned int MEMO_TEXT_BYTES = 0x4004;
 // The memo is flushed whole once it holds more entries than this.
 const unsigned int MEMO_ENTRIES = 32;
+
+// Checks the two tables of a cache opened from disk before they serve, in
+// time linear in the directories table and in both tables' pointer and index
+// files: each has exactly the schema above and only the indexes above (one
+// may be missing: the table then walks), FS_Table::verify passes and arms
+// the tables' guards, and every directory row has an id from 1 to the
+// counter, no other row has that id, and its parent is 0 or an existing id.
+// True when all holds; otherwise false with the file and the check of the
+// first failure in *file and *check.
+bool checkCacheTables(FS_Table* directories, FS_Table* files, unsigned int counter,
+                      std::wstring* file, char const** check);
 }  // namespace cachetables
 
 // The query function path(directory id, file name) over cache rows: the full

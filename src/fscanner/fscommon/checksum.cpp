@@ -1,5 +1,9 @@
 #include "fscanner/fscommon/checksum.h"
 
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -426,12 +430,73 @@ bool getFileSignature_MD5(char* out, char const* first, char const* second, unsi
 
 // --- File sums --------------------------------------------------------------------
 
+namespace {
+
+// Opens path for reading without ever blocking in the open and without
+// reading anything that would not end: a pipe without a writer or a device
+// that waits for its medium would block in a plain open, and a device such
+// as /dev/zero reads for ever.  O_NONBLOCK keeps the open from blocking, the
+// fstat that follows refuses every kind but a regular file (a directory too,
+// unless directories is set: its open succeeds and its first read fails, as
+// it always has), and the non-blocking mode is cleared again before the
+// first read, so a regular file is read exactly as fopen would read it.
+// With followLinks false, O_NOFOLLOW refuses a link in the last component.
+// A refused kind gives null with errno EINVAL.  Null path: null, errno
+// untouched.
+FILE* openForSums(char const* path, bool followLinks, bool directories) {
+    if (path == nullptr) return nullptr;
+    int flags = O_RDONLY | O_NONBLOCK | O_CLOEXEC;
+    if (!followLinks) flags |= O_NOFOLLOW;
+    int fd = ::open(path, flags);
+    if (fd < 0) return nullptr;
+    struct stat status;
+    if (::fstat(fd, &status) != 0) {
+        int error = errno;
+        ::close(fd);
+        errno = error;
+        return nullptr;
+    }
+    if (!S_ISREG(status.st_mode) && !(directories && S_ISDIR(status.st_mode))) {
+        ::close(fd);
+        errno = EINVAL;
+        return nullptr;
+    }
+    int mode = ::fcntl(fd, F_GETFL);
+    if (mode < 0 || ::fcntl(fd, F_SETFL, mode & ~O_NONBLOCK) != 0) {
+        int error = errno;
+        ::close(fd);
+        errno = error;
+        return nullptr;
+    }
+    FILE* file = ::fdopen(fd, "rb");
+    if (file == nullptr) {
+        int error = errno;
+        ::close(fd);
+        errno = error;
+    }
+    return file;
+}
+
+int computeSums(FileChecksumInfo& info, char const* path, bool followLinks, bool directories);
+
+}  // namespace
+
 int computeFileChecksumInfo(FileChecksumInfo& info, char const* path) {
+    return computeSums(info, path, true, true);
+}
+
+int computeRegularFileChecksumInfo(FileChecksumInfo& info, char const* path) {
+    return computeSums(info, path, false, false);
+}
+
+namespace {
+
+int computeSums(FileChecksumInfo& info, char const* path, bool followLinks, bool directories) {
     info.valid = true;
     const uint32_t wanted = info.flags;
     if (wanted == 0) return 0;
 
-    FILE* file = path != nullptr ? std::fopen(path, "rb") : nullptr;
+    FILE* file = openForSums(path, followLinks, directories);
     if (file == nullptr) {
         int error = path != nullptr ? errno : EINVAL;
         info.valid = false;
@@ -501,3 +566,5 @@ int computeFileChecksumInfo(FileChecksumInfo& info, char const* path) {
     std::fclose(file);
     return result;
 }
+
+}  // namespace

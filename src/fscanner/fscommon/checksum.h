@@ -63,7 +63,15 @@ struct FileChecksumInfo {
 // the sums of what was read before the failure are stored.  Sums that were not
 // asked for come out as the sums of empty input.  Calls
 // CpuThreshold::doIteration() once after each sum is fed with a chunk.
+// Only a regular file (or a directory, whose first read fails) is read: the
+// open never blocks, and a pipe, a device or a socket gives -1 at once.
 int computeFileChecksumInfo(FileChecksumInfo& info, char const* path);
+
+// The walks' form, for a path that an lstat found to be a regular file: the
+// entry may have been replaced since, so a link in the last component is not
+// followed and anything but a regular file (a directory too) gives -1 with
+// valid false and the sums untouched.  Otherwise as computeFileChecksumInfo.
+int computeRegularFileChecksumInfo(FileChecksumInfo& info, char const* path);
 
 // --- CRC-32 ---------------------------------------------------------------
 

@@ -113,10 +113,11 @@ inline void putBig64(std::string* dst, uint64_t value) {
 
 // Writes the encoding of value at the END of buffer[0..size) and returns the
 // index of its first byte; the encoded length is size minus that index.  Zero
-// is one byte 0x00, so the result for 0 is size - 1.  size must be at least
-// kMaxCompressedLength (smaller buffers get -1 and nothing written).
+// is one byte 0x00, so the result for 0 is size - 1.  A buffer too small for
+// the encoding (or a null one) gets -1 and nothing written.
+inline int compressedLength(uint64_t value);
 inline int encodeCompressedBackward(uint64_t value, char* buffer, int size) {
-    if (size < kMaxCompressedLength) return -1;
+    if (buffer == nullptr || size < compressedLength(value)) return -1;
     int index = size - 1;
     // Last byte: continuation bit clear.
     buffer[index] = static_cast<char>((value & 0x7F) << 1);

@@ -356,12 +356,14 @@ int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& path
                 if (wanted & FileProcessor::PROCESS_CRC32) checksums.flags |= FILE_CHECKSUM_CRC32;
                 if (wanted & FileProcessor::PROCESS_Q32) checksums.flags |= FILE_CHECKSUM_Q32;
                 if (wanted & FileProcessor::PROCESS_MD5) checksums.flags |= FILE_CHECKSUM_MD5;
-                // A link's content is never read: the sums then still hold
-                // what the previous file of this directory left in them.
-                if ((attr & FsFileInfo::ATTR_SYMLINK) == 0) {
+                // Only a regular file's content is read.  A link, a pipe or a
+                // device is not opened (a pipe would block, a device may never
+                // end): the sums then still hold what the previous file of
+                // this directory left in them.
+                if ((attr & FsFileInfo::ATTR_REGULAR) != 0) {
                     std::vector<char> narrowFile(kNarrowPathBytes);
                     if (narrowFullPath(info.getPath(), info.getName(), narrowFile.data())) {
-                        computeFileChecksumInfo(checksums, narrowFile.data());
+                        computeRegularFileChecksumInfo(checksums, narrowFile.data());
                     }
                 }
             }

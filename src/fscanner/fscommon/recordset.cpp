@@ -13,6 +13,23 @@
 
 // ---- __recordSet ---------------------------------------------------------------
 
+namespace {
+
+Field* lookup(Fields* record, wchar_t const* name) { return record->name(name); }
+Field* lookup(Fields* record, unsigned int i) { return i < record->count() ? record->at(i) : nullptr; }
+
+// The column the caller names, when the buffer has it with the type the
+// caller expects; null otherwise.  The schema comes from the table file's
+// header, so a damaged header must fail the call instead of the process:
+// getters then answer 0 or null and setters store nothing.
+template <class F, class Key>
+F* column(Fields* record, Key key, unsigned int type) {
+    Field* f = lookup(record, key);
+    return (f != nullptr && f->getType() == type) ? static_cast<F*>(f) : nullptr;
+}
+
+}  // namespace
+
 __recordSet::__recordSet()
     : id(0),
       position(0),
@@ -190,77 +207,89 @@ int __recordSet::unlock() {
 }
 
 unsigned char __recordSet::getFieldAsInt8(wchar_t const* name) {
-    return static_cast<Int8Field*>(record->name(name))->value();
+    Int8Field* f = column<Int8Field>(record, name, FIELD_INT8);
+    return f != nullptr ? f->value() : 0;
 }
 unsigned char __recordSet::getFieldAsInt8(unsigned int i) {
-    return static_cast<Int8Field*>(record->at(i))->value();
+    Int8Field* f = column<Int8Field>(record, i, FIELD_INT8);
+    return f != nullptr ? f->value() : 0;
 }
 unsigned short __recordSet::getFieldAsInt16(wchar_t const* name) {
-    return static_cast<Int16Field*>(record->name(name))->value();
+    Int16Field* f = column<Int16Field>(record, name, FIELD_INT16);
+    return f != nullptr ? f->value() : 0;
 }
 unsigned short __recordSet::getFieldAsInt16(unsigned int i) {
-    return static_cast<Int16Field*>(record->at(i))->value();
+    Int16Field* f = column<Int16Field>(record, i, FIELD_INT16);
+    return f != nullptr ? f->value() : 0;
 }
 unsigned int __recordSet::getFieldAsInt32(wchar_t const* name) {
-    return static_cast<Int32Field*>(record->name(name))->value();
+    Int32Field* f = column<Int32Field>(record, name, FIELD_INT32);
+    return f != nullptr ? f->value() : 0;
 }
 unsigned int __recordSet::getFieldAsInt32(unsigned int i) {
-    return static_cast<Int32Field*>(record->at(i))->value();
+    Int32Field* f = column<Int32Field>(record, i, FIELD_INT32);
+    return f != nullptr ? f->value() : 0;
 }
 unsigned long long __recordSet::getFieldAsInt64(wchar_t const* name) {
-    return static_cast<Int64Field*>(record->name(name))->value();
+    Int64Field* f = column<Int64Field>(record, name, FIELD_INT64);
+    return f != nullptr ? f->value() : 0;
 }
 unsigned long long __recordSet::getFieldAsInt64(unsigned int i) {
-    return static_cast<Int64Field*>(record->at(i))->value();
+    Int64Field* f = column<Int64Field>(record, i, FIELD_INT64);
+    return f != nullptr ? f->value() : 0;
 }
 wchar_t const* __recordSet::getFieldAsString(wchar_t const* name) {
-    return static_cast<TextField*>(record->name(name))->value();
+    TextField* f = column<TextField>(record, name, FIELD_TEXT);
+    return f != nullptr ? f->value() : nullptr;
 }
 wchar_t const* __recordSet::getFieldAsString(unsigned int i) {
-    return static_cast<TextField*>(record->at(i))->value();
+    TextField* f = column<TextField>(record, i, FIELD_TEXT);
+    return f != nullptr ? f->value() : nullptr;
 }
 unsigned char const* __recordSet::getFieldAsHex(wchar_t const* name) {
-    return static_cast<HexField*>(record->name(name))->value();
+    HexField* f = column<HexField>(record, name, FIELD_HEX);
+    return f != nullptr ? f->value() : nullptr;
 }
 unsigned char const* __recordSet::getFieldAsHex(unsigned int i) {
-    return static_cast<HexField*>(record->at(i))->value();
+    HexField* f = column<HexField>(record, i, FIELD_HEX);
+    return f != nullptr ? f->value() : nullptr;
 }
 
 void __recordSet::setFieldAsInt8(wchar_t const* name, unsigned char v) {
-    static_cast<Int8Field*>(record->name(name))->value(v);
+    if (Int8Field* f = column<Int8Field>(record, name, FIELD_INT8)) f->value(v);
 }
 void __recordSet::setFieldAsInt8(unsigned int i, unsigned char v) {
-    static_cast<Int8Field*>(record->at(i))->value(v);
+    if (Int8Field* f = column<Int8Field>(record, i, FIELD_INT8)) f->value(v);
 }
 void __recordSet::setFieldAsInt16(wchar_t const* name, unsigned short v) {
-    static_cast<Int16Field*>(record->name(name))->value(v);
+    if (Int16Field* f = column<Int16Field>(record, name, FIELD_INT16)) f->value(v);
 }
 void __recordSet::setFieldAsInt16(unsigned int i, unsigned short v) {
-    static_cast<Int16Field*>(record->at(i))->value(v);
+    if (Int16Field* f = column<Int16Field>(record, i, FIELD_INT16)) f->value(v);
 }
 void __recordSet::setFieldAsInt32(wchar_t const* name, unsigned int v) {
-    static_cast<Int32Field*>(record->name(name))->value(v);
+    if (Int32Field* f = column<Int32Field>(record, name, FIELD_INT32)) f->value(v);
 }
 void __recordSet::setFieldAsInt32(unsigned int i, unsigned int v) {
-    static_cast<Int32Field*>(record->at(i))->value(v);
+    if (Int32Field* f = column<Int32Field>(record, i, FIELD_INT32)) f->value(v);
 }
 void __recordSet::setFieldAsInt64(wchar_t const* name, unsigned long long v) {
-    static_cast<Int64Field*>(record->name(name))->value(v);
+    if (Int64Field* f = column<Int64Field>(record, name, FIELD_INT64)) f->value(v);
 }
 void __recordSet::setFieldAsInt64(unsigned int i, unsigned long long v) {
-    static_cast<Int64Field*>(record->at(i))->value(v);
+    if (Int64Field* f = column<Int64Field>(record, i, FIELD_INT64)) f->value(v);
 }
 void __recordSet::setFieldAsString(wchar_t const* name, wchar_t const* v) {
-    static_cast<TextField*>(record->name(name))->value(v);
+    if (TextField* f = column<TextField>(record, name, FIELD_TEXT)) f->value(v);
 }
 void __recordSet::setFieldAsString(unsigned int i, wchar_t const* v) {
-    static_cast<TextField*>(record->at(i))->value(v);
+    if (TextField* f = column<TextField>(record, i, FIELD_TEXT)) f->value(v);
 }
 void __recordSet::setFieldAsHex(wchar_t const* name, unsigned char const* v) {
-    static_cast<HexField*>(record->name(name))->value(v);
+    if (HexField* f = column<HexField>(record, name, FIELD_HEX)) f->value(v);
 }
 void __recordSet::setFieldAsHex(unsigned int i, unsigned char const* v) {
-    static_cast<HexField*>(record->at(i))->value(v);
+    if (HexField* f = column<HexField>(record, i, FIELD_HEX)) f->value(v);
 }
 
 void __recordSet::printFields() {

@@ -47,6 +47,9 @@ public:
     int lock(int timeout);
     int unlock();
 
+    // Field access by name or position.  A column the buffer lacks, or holds
+    // with another type than the call's, fails the call: getters give 0 or
+    // null, setters store nothing.
     unsigned char getFieldAsInt8(wchar_t const* name);
     unsigned char getFieldAsInt8(unsigned int index);
     unsigned short getFieldAsInt16(wchar_t const* name);

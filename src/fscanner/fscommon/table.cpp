@@ -264,7 +264,8 @@ FS_Table::FS_Table(wchar_t const* tableName, wchar_t const* dir, bool compressed
       schema(),
       indexes(),
       recordSets(),
-      mutex(nullptr) {
+      mutex(nullptr),
+      guard(nullptr) {
     if (tableName == nullptr || dir == nullptr) return;
     PathHelper helper;
     wchar_t* real = helper.realPath(dir, false);
@@ -319,6 +320,7 @@ FS_Table::~FS_Table() {
     }
     // Cursors are owned by the table.
     deleteRecordSets();
+    dropGuard();
 }
 
 wchar_t* FS_Table::indexListPath() { return wideJoin(directory, indexListName); }
@@ -441,6 +443,7 @@ bool FS_Table::close() {
     // A cursor never outlives the open table it walks.
     deleteRecordSets();
     schema.removeAll();
+    dropGuard();
     return true;
 }
 
@@ -524,6 +527,7 @@ bool FS_Table::insert(Fields& record) {
     }
     bool counted = incCount(0);
     bool indexed = hashIndexesUpdate(record, id);
+    if (guard != nullptr) guardInsert(record, id);
     return counted && indexed;
 }
 
@@ -619,6 +623,10 @@ bool FS_Table::readValue(Field* field) {
 }
 
 bool FS_Table::read(unsigned int id, Fields& record) {
+    return guard != nullptr ? guardedRead(id, record) : readRecord(id, record);
+}
+
+bool FS_Table::readRecord(unsigned int id, Fields& record) {
     // A closed table answers true and leaves record alone: callers rely on it.
     if (dataFile == nullptr || pointerFile == nullptr) return true;
     uint32_t offset;

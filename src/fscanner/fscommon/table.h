@@ -19,6 +19,7 @@
 
 class __recordSet;
 class RecordSet;
+struct TableGuard;
 
 // Writes the 7-bit group encoding of value at the end of buffer[0..size) and
 // returns the index of its first byte (length = size - index).  The table
@@ -69,6 +70,12 @@ public:
     bool read(unsigned int slot, unsigned int* id, unsigned int* next);
     // Puts id at the head of bucket's chain.
     bool write(unsigned int bucket, unsigned int id);
+    // Number of whole slots in the file; false when it is closed or its size
+    // is not a whole number of slots (table_verify.cpp).
+    bool slotCount(unsigned int* count);
+    // Reads count slots from slot first into words, two words a slot; false
+    // on a short read.
+    bool readSlots(unsigned int first, unsigned int count, uint32_t* words);
 
 private:
     Index& operator=(const Index&) = delete;
@@ -194,6 +201,24 @@ public:
     static void setBit(unsigned int index, unsigned char* buffer);
     static bool checkBit(unsigned int index, unsigned char const* buffer);
 
+    // Integrity guard (table_verify.cpp).  The formats carry no checksum, so
+    // what can be checked is the agreement of the files with each other.
+    // verify() checks an open table in time linear in its pointer and index
+    // files: whole slots, counts equal to the live and removed slots, live
+    // slots at rising offsets inside the records, and every index a sound set
+    // of chains holding each record number exactly once.  Passing or not, it
+    // arms the guard until close(): read() then fails a live record that runs
+    // past the data file, does not end where the next live record starts, or
+    // holds a key that hashes elsewhere than the bucket its index entry is
+    // filed under.  The first failed check is kept as the table's damage; a
+    // damaged table's reads fail.  False with the damage set on a failed
+    // check, false without damage on a closed table.
+    bool verify();
+    bool isDamaged() const;
+    // The file and the check of the first failure; null while none failed.
+    wchar_t const* damagedFile() const;
+    char const* damagedCheck() const;
+
 private:
     FS_Table(const FS_Table&) = delete;
     FS_Table& operator=(const FS_Table&) = delete;
@@ -205,6 +230,15 @@ private:
     bool writeValue(Field* field);
     bool readValue(Field* field);
     wchar_t* indexListPath();
+    // The read without the guard's checks.
+    bool readRecord(unsigned int id, Fields& record);
+    bool guardedRead(unsigned int id, Fields& record);
+    // Keeps the buckets of a record inserted under the guard.
+    void guardInsert(Fields& record, unsigned int id);
+    // Keeps file and check as the damage unless one is kept; returns false.
+    bool noteDamage(wchar_t const* file, char const* check);
+    bool verifyIndex(Index& index, uint32_t slots);
+    void dropGuard();
 
     AbstractFile* dataFile;
     AbstractFile* pointerFile;
@@ -223,6 +257,7 @@ private:
     std::vector<Index*> indexes;
     std::vector<__recordSet*> recordSets;
     AbstractMutex* mutex;
+    TableGuard* guard;
 };
 
 #endif
