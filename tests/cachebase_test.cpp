@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <dirent.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -445,4 +446,67 @@ TEST_F(CacheTest, WithoutCheckerNoFlagFileIsMade)
     ASSERT_EQ(0, c.create(0, FS_CACHE_CREATE));
     EXPECT_FALSE(testsupport::fileExists(dir.file("dirs.cuflag")));
     c.close();
+}
+
+// The engine never makes its directory: a host that forgot to learns so from
+// a trace that names the directory, beside the one about a damaged cache.
+TEST_F(CacheTest, MissingCacheDirectoryIsNamedInTheTrace)
+{
+    std::string missing = dir.file("not-made");
+    FS_Cache c(L"dirs", L"files", widen(missing).c_str(), false, true, &glue, L"prov");
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(-53, c.create(0, FS_CACHE_OPEN_ALWAYS));
+    EXPECT_TRUE(cap.contains("FS_Cache::traceCacheDirectoryProblem - cache directory '" + missing +
+                             "' does not exist: No such file or directory"));
+    EXPECT_FALSE(testsupport::fileExists(missing));
+}
+
+TEST_F(CacheTest, PlainFileInPlaceOfTheCacheDirectoryIsNamedInTheTrace)
+{
+    std::string file = dir.write("a-file", "x");
+    FS_Cache c(L"dirs", L"files", widen(file).c_str(), false, true, &glue, L"prov");
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(-53, c.create(0, FS_CACHE_OPEN_ALWAYS));
+    EXPECT_TRUE(cap.contains("FS_Cache::traceCacheDirectoryProblem - cache directory '" + file +
+                             "' is not a directory"));
+}
+
+// Root may write anywhere: as root, the check runs in a child that has
+// become the user "nobody" (65534).
+TEST_F(CacheTest, UnwritableCacheDirectoryIsNamedInTheTrace)
+{
+    std::string readOnly = dir.mkdirs("read-only");
+    ASSERT_EQ(0, chmod(dir.path().c_str(), 0755));
+    ASSERT_EQ(0, chmod(readOnly.c_str(), 0555));
+    std::string lockDir = locks.path();
+    ASSERT_EQ(0, chmod(lockDir.c_str(), 0777));
+    pid_t child = fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        if (geteuid() == 0 && (setgid(65534) != 0 || setuid(65534) != 0))
+            _exit(3);
+        FS_Cache c(L"dirs", L"files", widen(readOnly).c_str(), false, true, &glue, L"prov");
+        testsupport::TraceCapture cap;
+        if (c.create(0, FS_CACHE_OPEN_ALWAYS) != -53)
+            _exit(4);
+        _exit(cap.contains("FS_Cache::traceCacheDirectoryProblem - cache directory '" + readOnly +
+                           "' is not writable: Permission denied")
+                  ? 0
+                  : 5);
+    }
+    int status = 0;
+    ASSERT_EQ(child, waitpid(child, &status, 0));
+    chmod(readOnly.c_str(), 0755);
+    ASSERT_TRUE(WIFEXITED(status));
+    EXPECT_EQ(0, WEXITSTATUS(status)) << "3: no other user, 4: create did not fail, 5: no trace";
+}
+
+// A usable directory adds no such trace, also when the open fails for
+// another reason.
+TEST_F(CacheTest, UsableCacheDirectoryAddsNoDirectoryTrace)
+{
+    FS_Cache c(L"dirs", L"files", wdir.c_str(), false, true, &glue, L"prov");
+    testsupport::TraceCapture cap;
+    EXPECT_EQ(-53, c.create(0, FS_CACHE_OPEN));
+    EXPECT_FALSE(cap.contains("cache directory '"));
 }

@@ -6,6 +6,7 @@
 #include <cstring>
 #include <cwchar>
 #include <new>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include "base/CpuThreshold.h"
@@ -449,6 +450,8 @@ int FS_CacheBase::create(unsigned int timeout, int creationDisposition)
                       __func__);
         cacheOpened = true;
         result = SUCCESS;
+    } else {
+        traceCacheDirectoryProblem();
     }
     readMd5OfExclude();
     return result;
@@ -569,6 +572,33 @@ std::string narrowName(wchar_t const* name)
 }
 
 }  // namespace
+
+// The likeliest reason a cache cannot be opened or made is its directory:
+// the engine never makes it, so a host that forgot to gets this trace instead
+// of only the one about a damaged cache.
+void FS_CacheBase::traceCacheDirectoryProblem()
+{
+    if (cachePathName == nullptr)
+        return;
+    std::string directory = narrowName(cachePathName);
+    struct stat status;
+    char const* problem = nullptr;
+    int error = 0;
+    if (stat(directory.c_str(), &status) != 0) {
+        error = errno;
+        problem = error == ENOENT ? "does not exist" : "cannot be examined";
+    } else if (!S_ISDIR(status.st_mode)) {
+        problem = "is not a directory";
+    } else if (access(directory.c_str(), W_OK | X_OK) != 0) {
+        error = errno;
+        problem = "is not writable";
+    }
+    if (problem == nullptr)
+        return;
+    log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - cache directory '%s' %s%s%s", className,
+                  __func__, directory.c_str(), problem, error != 0 ? ": " : "",
+                  error != 0 ? strerror(error) : "");
+}
 
 bool FS_CacheBase::insideCacheUpdate()
 {

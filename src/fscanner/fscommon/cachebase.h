@@ -290,6 +290,9 @@ public:
     wchar_t* catSetFileName;
 
 private:
+    // Traces why the cache directory cannot hold a cache (missing, not a
+    // directory, not writable), naming it; nothing when it looks usable.
+    void traceCacheDirectoryProblem();
     // Points set at the rows whose column equals a value, through the hash
     // index: the column and value go into hashValue, the value into the
     // variable, then the criterion is set on the cursor.  text null: the
