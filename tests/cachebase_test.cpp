@@ -13,11 +13,12 @@
 #include "fscanner/fscommon/cache2.h"
 #include "fscanner/fscommon/sync.h"
 #include "fscanner/fscommon/recordset.h"
+#include "support/cachefixture.h"
 #include "support/testsupport.h"
 
 namespace {
 
-std::wstring widen(const std::string& s) { return std::wstring(s.begin(), s.end()); }
+using testsupport::widen;
 
 std::set<std::string> listDir(const std::string& path)
 {

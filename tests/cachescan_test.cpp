@@ -20,11 +20,12 @@
 #include "fscanner/fscommon/recordset.h"
 #include "fscanner/fscommon/sync.h"
 #include "fscanner/fscommon/table.h"
+#include "support/cachefixture.h"
 #include "support/testsupport.h"
 
 namespace {
 
-std::wstring widen(const std::string& s) { return std::wstring(s.begin(), s.end()); }
+using testsupport::widen;
 std::string narrow(const wchar_t* w)
 {
     std::string out;

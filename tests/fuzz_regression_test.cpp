@@ -17,6 +17,7 @@
 #include "fscanner/fscommon/recordset.h"
 #include "fscanner/fscommon/sync.h"
 #include "fscanner/fscommon/table.h"
+#include "support/cachefixture.h"
 #include "support/testsupport.h"
 
 namespace {
@@ -25,7 +26,7 @@ std::string bytes(const unsigned char* data, size_t size) {
     return std::string(reinterpret_cast<const char*>(data), size);
 }
 
-std::wstring widen(const std::string& narrow) { return std::wstring(narrow.begin(), narrow.end()); }
+using testsupport::widen;
 
 // A table "t" in a temp dir, its lock file in a second temp dir.
 class DamagedTableTest : public ::testing::Test {

@@ -7,6 +7,7 @@
 #include "fscanner/fscommon/cachebase.h"
 #include "fscanner/fscommon/checksum.h"
 #include "fscanner/fscommon/sync.h"
+#include "support/cachefixture.h"
 #include "support/testsupport.h"
 
 namespace {
@@ -19,7 +20,7 @@ public:
     void saveOrRestoreFilesOrMasksForCaching(FsQuery const&) override {}
 };
 
-std::wstring widen(const std::string& s) { return std::wstring(s.begin(), s.end()); }
+using testsupport::widen;
 
 std::string md5Text(const std::string& bytes)
 {
