@@ -7,7 +7,9 @@
 # then times, in one run and on the same tree: the first fsquery run (walk,
 # lstat of every entry, tables and indexes written), the same query again
 # (served from the cache), an exact-name query answered through the index, a
-# wildcard query, and the same questions put to find, fd and plocate.  Each
+# wildcard query, a query sorted by size through the result file and the same
+# query piped to sort(1), and the same questions put to find, fd and plocate;
+# then the result file's sort alone against sort(1) (resultsort_bench).  Each
 # command runs RUNS times (default 5); the table gives the median wall time and
 # the peak resident memory over the runs, then the ratios the tool is held to.
 #
@@ -92,6 +94,8 @@ measure "fsquery: same query from the cache" ":" "$FSQ" --cache "$CACHE" "$TREE"
 measure "fsquery: exact name (index)" ":" "$FSQ" --cache "$CACHE" --name needle.conf "$TREE"
 measure "fsquery: wildcard *.c (cache)" ":" "$FSQ" --cache "$CACHE" --name '*.c' "$TREE"
 measure "fsquery --no-cache: wildcard *.c" ":" "$FSQ" --no-cache --cache "$CACHE" --name '*.c' "$TREE"
+measure "fsquery --sort size (cache)" ":" "$FSQ" --cache "$CACHE" --sort size "$TREE"
+measure "fsquery | sort (cache)" ":" bash -c "'$FSQ' --cache '$CACHE' '$TREE' | sort"
 measure "find: exact name" ":" find "$TREE" -name needle.conf
 measure "find: wildcard *.c" ":" find "$TREE" ! -type d -name '*.c'
 if [ -n "$FD" ]; then
@@ -145,3 +149,14 @@ for name in "${ORDER[@]}"; do
 done
 peak_mib=$(awk -v k="$peak" 'BEGIN {printf "%.1f", k / 1024}')
 echo "| peak memory of any fsquery run (MiB) | $peak_mib | 64 | $(verdict "$peak_mib" "<" 64) |"
+
+# ------------------------------------------------------------ result sort
+# The sort of a result file alone against sort(1) on the same hits, in one
+# run: medians of alternating rounds and their ratio (bench/resultsort_bench.cpp).
+SORT_BENCH=$BUILD/resultsort_bench
+if [ -x "$SORT_BENCH" ]; then
+    echo
+    rounds=$RUNS
+    if [ "$rounds" -lt 5 ]; then rounds=5; fi
+    "$SORT_BENCH" "$TREE" "$rounds"
+fi

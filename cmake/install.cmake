@@ -21,6 +21,7 @@ set(FSCANNER_PUBLIC_HEADERS
   fscanner/fscommon/cache2.h
   fscanner/fscommon/cachebase.h
   fscanner/fscommon/expvalue.h
+  fscanner/fscommon/querystats.h
   fscanner/fscommon/stringhelper.h
   fscanner/fscommon/sync.h)
 set(FSCANNER_PUBLIC_BASE_HEADERS

@@ -323,9 +323,12 @@ TEST_F(FsQueryTool, QueryPathSyntaxWithMediaAndDriveIsAccepted) {
     EXPECT_EQ(paths({"a/x.c", "a/b/y.c"}), media.lineSet());
     ToolRun drive = query({"--name", "*.c", "/:" + path("a/b")});
     EXPECT_EQ(paths({"a/b/y.c"}), drive.lineSet());
-    // No drive is remote in this mount table, so the remote media finds nothing.
+    // No drive is remote in this mount table: the remote media names no
+    // directory, which is a usage error naming the path.
     ToolRun remote = query({"$remote::" + tree});
-    EXPECT_EQ(0, remote.status);
+    EXPECT_EQ(2, remote.status);
+    EXPECT_EQ("fsquery: '$remote::" + tree + "' names no directory: no drive of the mount table answers it\n",
+              remote.err);
     EXPECT_EQ("", remote.out);
 }
 
@@ -413,7 +416,7 @@ bool parseJsonObject(const std::string& line, std::map<std::string, std::string>
     }
 }
 
-TEST_F(FsQueryTool, JsonFormatIsOneObjectPerLineWithEveryField) {
+TEST_F(FsQueryTool, JsonFormatIsOneObjectPerLineWithTheFieldsOfTheAnswer) {
     ToolRun r = query({"--format", "json", "--name", "*.c", tree});
     ASSERT_EQ(0, r.status) << r.err;
     std::vector<std::string> lines = r.lines();
@@ -426,28 +429,36 @@ TEST_F(FsQueryTool, JsonFormatIsOneObjectPerLineWithEveryField) {
     }
     ASSERT_EQ(1u, byName.count("s:x.c"));
     std::map<std::string, std::string>& x = byName["s:x.c"];
-    for (const char* key : {"path", "name", "fullPath", "md5", "sha256", "attr", "size", "device", "groupId",
-                            "userId", "iNode", "lastAccessTime", "createTime", "lastModifyTime", "linkCount",
-                            "crc32", "q32", "validMask", "statFailed"}) {
+    for (const char* key : {"path", "name", "fullPath", "md5", "sha256", "attr", "size", "crc32", "q32"}) {
         EXPECT_EQ(1u, x.count(key)) << key;
     }
-    EXPECT_EQ(19u, x.size());
+    EXPECT_EQ(9u, x.size());
     EXPECT_EQ("s:" + path("a/"), x["path"]);
     EXPECT_EQ("s:" + path("a/x.c"), x["fullPath"]);
     EXPECT_EQ("3", x["size"]);
-    EXPECT_EQ("s:0", x["md5"]);
-    EXPECT_EQ("s:0", x["sha256"]);
-    EXPECT_EQ("1", x["linkCount"]);
-    EXPECT_EQ("false", x["statFailed"]);
+    // No checksum was asked for.
+    EXPECT_EQ("null", x["md5"]);
+    EXPECT_EQ("null", x["sha256"]);
+    EXPECT_EQ("null", x["crc32"]);
+    EXPECT_EQ("null", x["q32"]);
     unsigned long attr = std::stoul(x["attr"]);
     EXPECT_EQ(0x2000u, attr & 0x3001u);  // a regular file, not a directory or link
     EXPECT_EQ(0x2u, attr & 0x2u);        // the owner may read it
+    EXPECT_EQ("6", byName["s:y.c"]["size"]);
+
+    // The status fields come with --stat, read from the file.
+    ToolRun stat = query({"--format", "json", "--stat", "--name", "x.c", tree});
+    ASSERT_EQ(0, stat.status) << stat.err;
+    std::map<std::string, std::string> s;
+    ASSERT_TRUE(parseJsonObject(stat.lines().at(0), s)) << stat.out;
+    EXPECT_EQ(17u, s.size());
     struct stat st;
     ASSERT_EQ(0, lstat(path("a/x.c").c_str(), &st));
-    EXPECT_EQ(std::to_string(static_cast<unsigned int>(st.st_ino)), x["iNode"]);
-    EXPECT_EQ(std::to_string(static_cast<long>(st.st_mtime)), x["lastModifyTime"]);
-    EXPECT_EQ(std::to_string(st.st_uid), x["userId"]);
-    EXPECT_EQ("6", byName["s:y.c"]["size"]);
+    EXPECT_EQ(std::to_string(static_cast<unsigned int>(st.st_ino)), s["iNode"]);
+    EXPECT_EQ(std::to_string(static_cast<long>(st.st_mtime)), s["lastModifyTime"]);
+    EXPECT_EQ(std::to_string(st.st_uid), s["userId"]);
+    EXPECT_EQ("1", s["linkCount"]);
+    EXPECT_EQ("3", s["size"]);
 }
 
 TEST_F(FsQueryTool, JsonEscapesQuotesAndBackslashesInNames) {
@@ -467,20 +478,26 @@ TEST_F(FsQueryTool, CsvFormatHasAHeaderRowAndQuotedFields) {
     ASSERT_EQ(0, r.status) << r.err;
     std::vector<std::string> lines = r.lines();
     ASSERT_EQ(4u, lines.size());
-    EXPECT_EQ(
-        "path,name,fullPath,md5,sha256,attr,size,device,groupId,userId,iNode,lastAccessTime,createTime,"
-        "lastModifyTime,linkCount,crc32,q32",
-        lines[0]);
+    EXPECT_EQ("path,name,fullPath,md5,sha256,attr,size,crc32,q32", lines[0]);
     bool sawComma = false;
     for (size_t i = 1; i < lines.size(); ++i) {
         if (contains(lines[i], "\"a,b.c\"")) {
             sawComma = true;
-            EXPECT_EQ(0u, lines[i].find(path("") + ",\"a,b.c\",\"" + path("a,b.c") + "\",0,0,"));
+            // No checksum was asked for: the fields are empty.
+            EXPECT_EQ(0u, lines[i].find(path("") + ",\"a,b.c\",\"" + path("a,b.c") + "\",,,")) << lines[i];
         } else {
-            EXPECT_EQ(16, std::count(lines[i].begin(), lines[i].end(), ','));
+            EXPECT_EQ(8, std::count(lines[i].begin(), lines[i].end(), ','));
         }
     }
     EXPECT_TRUE(sawComma);
+    ToolRun stat = query({"--format", "csv", "--stat", "--name", "x.c", tree});
+    std::vector<std::string> statLines = stat.lines();
+    ASSERT_EQ(2u, statLines.size()) << stat.err;
+    EXPECT_EQ(
+        "path,name,fullPath,md5,sha256,attr,size,device,groupId,userId,iNode,lastAccessTime,createTime,"
+        "lastModifyTime,linkCount,crc32,q32",
+        statLines[0]);
+    EXPECT_EQ(16, std::count(statLines[1].begin(), statLines[1].end(), ','));
 }
 
 TEST_F(FsQueryTool, NullFormatPrintsNothingAndStillCountsHits) {

@@ -665,17 +665,15 @@ TEST(SpecialFileTool, Md5QueriesOverATreeWithAFifoCompleteInBothModes) {
     dir.write("tree/regular", "a\n");
     makeFifo(dir.file("tree/pipe"));
 
+    // Text output with sums lists only the files that have sums: the pipe,
+    // which is never read, gets no line in either mode.
     ToolRun direct = runTool(dir, {"--no-cache", "--md5", tree});
     ASSERT_EQ(0, direct.status) << direct.err;
-    // The walk reports no sums of its own; a file that is not read keeps the
-    // record's "0".
-    EXPECT_EQ((std::set<std::string>{kMd5OfA + "  " + tree + "/regular", "0  " + tree + "/pipe"}),
-              direct.lineSet());
+    EXPECT_EQ((std::set<std::string>{kMd5OfA + "  " + tree + "/regular"}), direct.lineSet());
 
     ToolRun cached = runTool(dir, {"--md5", tree});
     ASSERT_EQ(0, cached.status) << cached.err;
-    EXPECT_EQ((std::set<std::string>{kMd5OfA + "  " + tree + "/regular", kZeroMd5 + "  " + tree + "/pipe"}),
-              cached.lineSet());
+    EXPECT_EQ((std::set<std::string>{kMd5OfA + "  " + tree + "/regular"}), cached.lineSet());
 
     ToolRun named = runTool(dir, {"--no-cache", "--md5", "--timeout", "2000", "--name", "regular", tree});
     ASSERT_EQ(0, named.status) << named.err;
@@ -683,8 +681,7 @@ TEST(SpecialFileTool, Md5QueriesOverATreeWithAFifoCompleteInBothModes) {
 
     ToolRun crc = runTool(dir, {"--crc32", tree});
     ASSERT_EQ(0, crc.status) << crc.err;
-    EXPECT_EQ((std::set<std::string>{hex8(kCrcOfA) + "  " + tree + "/regular", "00000000  " + tree + "/pipe"}),
-              crc.lineSet());
+    EXPECT_EQ((std::set<std::string>{hex8(kCrcOfA) + "  " + tree + "/regular"}), crc.lineSet());
 
     ToolRun known = runTool(dir, {"--known-md5", kMd5OfA, tree});
     ASSERT_EQ(0, known.status) << known.err;

@@ -11,6 +11,7 @@
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
 #include "fscanner/fs/fs_loader.h"
+#include "fscanner/fs/fs_resultset_sort.h"
 #include "fscanner/fs/fs_serializer.h"
 #include "fscanner/fscommon/naturalmerge.h"
 #include "fscanner/fscommon/sysfactory.h"
@@ -54,81 +55,6 @@ char* fallbackTempName(const char* prefix) {
     return nullptr;
 }
 
-// ---- callbacks of the sort: records are FsFileInfo objects ------------------
-
-bool compareByKey(void* a, void* b, unsigned int op, bool flag, int key) {
-    if (a == nullptr || b == nullptr) return false;
-    return static_cast<FsFileInfo*>(a)->compare(*static_cast<FsFileInfo*>(b), key, op, flag);
-}
-bool compareByPath(void* a, void* b, unsigned int op, bool flag) {
-    return compareByKey(a, b, op, flag, FsFileInfo::COMPARE_PATH);
-}
-bool compareByName(void* a, void* b, unsigned int op, bool flag) {
-    return compareByKey(a, b, op, flag, FsFileInfo::COMPARE_NAME);
-}
-bool compareByFullPath(void* a, void* b, unsigned int op, bool flag) {
-    return compareByKey(a, b, op, flag, FsFileInfo::COMPARE_FULL_PATH);
-}
-bool compareBySize(void* a, void* b, unsigned int op, bool flag) {
-    return compareByKey(a, b, op, flag, FsFileInfo::COMPARE_SIZE);
-}
-
-// A load that fails before the end of the file met damaged bytes and stopped
-// somewhere inside them.  The sort must not go on reading from there: it
-// would take the middle of a string for a new record and put records into the
-// sorted file that a reader never saw.  So damage ends the input, as it ends
-// a reader's walk: the file is moved to its end.  At the real end this is no
-// move at all, so valid files sort as before.
-void endInputAtDamage(AbstractFile* file) {
-    file->seek(0, SEEK_FROM_END);
-}
-
-int readRecord(AbstractFile* file, void** record) {
-    if (record == nullptr) return 0;
-    *record = nullptr;
-    if (file == nullptr) return 0;
-    FsFileInfo* info = new (std::nothrow) FsFileInfo();
-    if (info == nullptr) return 0;
-    FsSerializator_OnFile serializator(file, false);
-    if (info->loadObject(serializator) != 0) {
-        delete info;
-        endInputAtDamage(file);
-        return 0;
-    }
-    *record = info;
-    return 1;
-}
-
-int writeRecord(AbstractFile* file, void* record) {
-    if (file == nullptr || record == nullptr) return 0;
-    FsSerializator_OnFile serializator(file, false);
-    return static_cast<FsFileInfo*>(record)->saveObject(serializator) == 0 ? 1 : 0;
-}
-
-// A successful load must leave the file's end flag clear for the peek to
-// count; with a LinuxMmFile that holds whenever the record's bytes were there.
-bool peekRecord(AbstractFile* file, void** record) {
-    if (record == nullptr) return false;
-    *record = nullptr;
-    if (file == nullptr) return false;
-    long position = file->tell();
-    FsFileInfo* info = new (std::nothrow) FsFileInfo();
-    if (info == nullptr) return false;
-    FsSerializator_OnFile serializator(file, false);
-    if (info->loadObject(serializator) == 0 && !file->eof()) {
-        file->seek(position, SEEK_FROM_START);
-        *record = info;
-        return true;
-    }
-    delete info;
-    endInputAtDamage(file);
-    return false;
-}
-
-void freeRecord(void* record) {
-    delete static_cast<FsFileInfo*>(record);
-}
-
 // A LinuxMmFile on the 8-bit name, widened on the way as the factory wants.
 AbstractFile* makeFile(const char* name) {
     wchar_t* wide = utils::myMbsToWcsString(name);
@@ -141,10 +67,25 @@ AbstractFile* makeFile(const char* name) {
 
 void deleteFile_CleanupHandler(int code, void* name) {
     if (code == 0) return;
+    // The handler serves processes that end, often from a signal handler:
+    // the files go first, with nothing but unlink, and the trace after them.
+    // With the file go the scratch files of a sort that may be running on it.
+    if (name != nullptr) {
+        const char* file = static_cast<const char*>(name);
+        ::unlink(file);
+        char scratch[4096 + 8];
+        size_t length = std::strlen(file);
+        for (const char* suffix : {NATURAL_MERGE_SCRATCH_A, NATURAL_MERGE_SCRATCH_B}) {
+            size_t suffixLength = std::strlen(suffix);
+            if (length + suffixLength >= sizeof scratch) break;
+            std::memcpy(scratch, file, length);
+            std::memcpy(scratch + length, suffix, suffixLength + 1);
+            ::unlink(scratch);
+        }
+    }
     getQvLogFs()->traceMID(__LINE__, __FILE__, __func__,
                            "Cleanup handler invoked (code: %d), deleting temp file: %s\n", code,
                            static_cast<const char*>(name));
-    if (name != nullptr) ::unlink(static_cast<const char*>(name));
 }
 
 // ---- writer -----------------------------------------------------------------
@@ -240,16 +181,11 @@ int FsResultSetReader_OnFile::sort(unsigned int key, unsigned int order, bool fl
     QvLogWrapper* trace = getQvLogFs();
     trace->traceMID(__LINE__, __FILE__, __func__,
                     "FsResultSetReader_OnFile::sort - entering...\n");
-    NaturalMergeSort::CompareCallback compare = nullptr;
-    switch (key) {
-        case 1: compare = compareByPath; break;
-        case 2: compare = compareByName; break;
-        case 3: compare = compareByFullPath; break;
-        case 4: compare = compareBySize; break;
-        default:
-            trace->traceMID(__LINE__, __FILE__, __func__,
-                            "FsResultSetReader_OnFile::sort - exiting...\n");
-            return 0;
+    resultsort::PassCallbacks callbacks;
+    if (!resultsort::passCallbacks(key, callbacks)) {
+        trace->traceMID(__LINE__, __FILE__, __func__,
+                        "FsResultSetReader_OnFile::sort - exiting...\n");
+        return 0;
     }
 
     // The reader stands closed from here on; moveFirst() reopens it.
@@ -262,10 +198,10 @@ int FsResultSetReader_OnFile::sort(unsigned int key, unsigned int order, bool fl
     trace->traceMID(__LINE__, __FILE__, __func__,
                     "FsResultSetReader_OnFile::sort - file name is %S\n", wideName);
     NaturalMergeSort* sorter =
-        new NaturalMergeSort(compare, readRecord, writeRecord, peekRecord, freeRecord);
+        new NaturalMergeSort(callbacks.compare, callbacks.read, callbacks.write, callbacks.peek, callbacks.free);
     trace->traceMID(__LINE__, __FILE__, __func__,
                     "FsResultSetReader_OnFile::sort - naturalMergeSort object created!\n");
-    sorter->sort(wideName, order, flag);
+    if (!resultsort::sortInMemory(fileName, wideName, key, order, flag)) sorter->sort(wideName, order, flag);
     trace->traceMID(__LINE__, __FILE__, __func__,
                     "FsResultSetReader_OnFile::sort - file sorted!\n");
     delete sorter;

@@ -23,8 +23,11 @@ class AbstractFile;
 class FsSerializator;
 
 // Clean-up handler for a process that ends while its result sets live: with
-// a code other than 0 it traces and unlinks the file named by name (an 8-bit
-// name).  Code 0 does nothing.
+// a code other than 0 it unlinks the file named by name (an 8-bit name) and
+// the scratch files of a sort that may be running on it (the name followed
+// by ".a" and ".b"), then traces.  Only unlink runs before the trace, so the
+// files are gone even when the handler is called from a signal handler that
+// interrupted a trace.  Code 0 does nothing.
 void deleteFile_CleanupHandler(int code, void* name);
 
 // Writer: appends records to the file.  The file is created by the
@@ -72,7 +75,11 @@ public:
     // 0 for another key, with the reader untouched.  Otherwise the reader is
     // closed, the sort runs, and the result is 1 whatever the sort gave (an
     // order other than 1 or 2 leaves the file as it was).  moveFirst() comes
-    // next.
+    // next.  The order is that of NaturalMergeSort's passes, ties included.
+    // A file of up to 48 MiB is read once, ordered in memory and written
+    // once (under the first scratch name, then renamed over the file: a
+    // failure leaves it as it was); a larger one goes through the passes on
+    // disk, in constant memory.
     int sort(unsigned int key, unsigned int order, bool flag) override;
     // Remembers the position of the next record; 0 when the file is not open.
     int setBookmark() override;

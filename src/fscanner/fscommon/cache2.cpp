@@ -1,10 +1,13 @@
 #include "fscanner/fscommon/cache2.h"
 
+#include <cerrno>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <string>
+
+#include <unistd.h>
 
 #include "base/QvLogWrapper.h"
 #include "fscanner/fs/fs_query.h"
@@ -24,11 +27,12 @@ std::string catSetPath(wchar_t const* name)
     return buffer;
 }
 
-void writeRecord(FILE* f, std::wstring const& text)
+// True when the whole record went to the stream.
+bool writeRecord(FILE* f, std::wstring const& text)
 {
     uint32_t count = static_cast<uint32_t>(text.size());
-    fwrite(&count, 1, sizeof(count), f);
-    fwrite(text.data(), sizeof(wchar_t), text.size(), f);
+    return fwrite(&count, 1, sizeof(count), f) == sizeof(count) &&
+           fwrite(text.data(), sizeof(wchar_t), text.size(), f) == text.size();
 }
 
 }  // namespace
@@ -105,11 +109,22 @@ void FS_Cache2::saveOrRestoreFilesOrMasksForCaching(FsQuery const& constQuery)
     FILE* f = fopen(path.c_str(), "wb");
     if (f == nullptr)
         return;
+    bool written = true;
     std::set<std::wstring>& names = query.getFilesForCaching();
     for (std::set<std::wstring>::const_iterator it = names.begin(); it != names.end(); ++it)
-        writeRecord(f, *it);
+        written = written && writeRecord(f, *it);
     std::vector<std::wstring>& masks = query.getMasksForCaching();
     for (size_t i = 0; i < masks.size(); ++i)
-        writeRecord(f, masks[i]);
-    fclose(f);
+        written = written && writeRecord(f, masks[i]);
+    written = fflush(f) == 0 && written;
+    int reason = errno;
+    written = fclose(f) == 0 && written;
+    if (!written) {
+        // A set cut short by a full disk would be restored as a smaller set
+        // and quietly narrow what later builds keep.  No saved set is the
+        // state a reader knows how to take.
+        unlink(path.c_str());
+        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - cannot write '%s': %s; it is removed",
+                      className, __func__, path.c_str(), strerror(reason));
+    }
 }

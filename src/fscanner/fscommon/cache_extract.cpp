@@ -100,6 +100,15 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
     state.evaluator->addCmd(L"path", 1, 0, 1, state.pathCommand);
     state.evaluator->addCmd(L"type", 0, 1, 1, state.typeCommand);
     files.setCriteria(state.evaluator, caseSensitive);
+    FsQueryStatistics& statistics = queryStatistics();
+    if (files.get() != nullptr && files.get()->isIndexNavigation()) {
+        statistics.lookup = FsQueryStatistics::LOOKUP_INDEX;
+        ExpValue* hash = state.evaluator->getHashInfo();
+        wchar_t const* column = hash != nullptr ? hash->getNValueString() : nullptr;
+        statistics.indexColumn = column != nullptr ? column : L"";
+    } else {
+        statistics.lookup = FsQueryStatistics::LOOKUP_EVERY_ROW;
+    }
     state.filtered = &files;
     state.caseSensitive = caseSensitive;
 
@@ -215,6 +224,7 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
                          files.getFieldAsInt64(L"SIZE"), files.getFieldAsInt32(L"ATTR"),
                          files.getFieldAsString(L"MD5"), files.getFieldAsInt32(L"CRC32"),
                          files.getFieldAsInt32(L"Q32"));
+        statistics.addHit();
     }
     return SUCCESS;
 }

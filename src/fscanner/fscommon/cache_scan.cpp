@@ -8,12 +8,15 @@
 // very many files is never cut in the middle.
 
 #include <dirent.h>
+#include <sys/stat.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
 #include <cwchar>
+#include <string>
 #include <vector>
 
 #include "base/CpuThreshold.h"
@@ -70,6 +73,19 @@ bool narrowFilePath(wchar_t const* directory, wchar_t const* name, char* out)
         return false;
     out[used + more] = '\0';
     return true;
+}
+
+// Why the status of directory/name cannot be read, for the statistics: the
+// status call is made again, as the first one's errno may be gone.  0 when it
+// now succeeds.
+int statusError(std::string const& directory, char const* name)
+{
+    std::string path = directory;
+    if (path.empty() || path.back() != '/')
+        path += '/';
+    path += name;
+    struct stat status;
+    return lstat(path.c_str(), &status) == 0 ? 0 : errno;
 }
 
 }  // namespace
@@ -162,10 +178,12 @@ int FS_CacheBase::scan(FsQuery const& query, PathDrive& path, RecordSet& directo
     wchar_t const* pathName = path.getPathName();
     if (pathName == nullptr)
         return 0;
+    FsQueryStatistics& statistics = queryStatistics();
     size_t pathLength = wcslen(pathName);
     if (pathLength > SCAN_MAX_PATH) {
         log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - '%S' path too long", className,
                       __func__, pathName);
+        statistics.addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, pathName, 0);
         return 0;
     }
 
@@ -181,6 +199,10 @@ int FS_CacheBase::scan(FsQuery const& query, PathDrive& path, RecordSet& directo
     if (converted == static_cast<size_t>(-1) || converted >= narrowPathBufferSize) {
         log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - '%S' path can't be converted",
                       className, __func__, pathName);
+        statistics.addSkipped(converted == static_cast<size_t>(-1)
+                                  ? FsQueryStatistics::SKIP_UNDECODABLE_NAME
+                                  : FsQueryStatistics::SKIP_PATH_TOO_LONG,
+                              pathName, 0);
         return 0;
     }
     narrowPathBuffer[converted] = '\0';
@@ -240,11 +262,14 @@ int FS_CacheBase::scan(FsQuery const& query, PathDrive& path, RecordSet& directo
     }
 
     dirent** entries = nullptr;
-    int entryCount = ::scandir(narrowPathBuffer, &entries);
+    int readError = 0;
+    int entryCount = fs_readDirectory(narrowPathBuffer, &entries, &readError);
     CpuThreshold::doIteration();
     if (entryCount < 0) {
         log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - scandir error opening '%s' path!",
                       className, __func__, narrowPathBuffer);
+        statistics.addSkipped(FsQueryStatistics::SKIP_UNREADABLE_DIRECTORY, narrowPathBuffer,
+                              nullptr, readError);
         // A failed read may leave the entries it kept.
         if (entries != nullptr) {
             kelm_free(entries);
@@ -253,6 +278,13 @@ int FS_CacheBase::scan(FsQuery const& query, PathDrive& path, RecordSet& directo
     }
     if (scanHook != nullptr)
         scanHook(narrowPathBuffer);
+    // A read that broke off part way: what it read is stored as usual.
+    if (readError != 0)
+        statistics.addSkipped(FsQueryStatistics::SKIP_UNREADABLE_DIRECTORY, narrowPathBuffer,
+                              nullptr, readError);
+    // The recursion reuses narrowPathBuffer: skipped entries of this
+    // directory are named from a copy.
+    std::string directoryBytes(narrowPathBuffer);
     unsigned int start = utils::getTickCount();
 
     // The directory's path with one separator: room for the longest child.
@@ -281,7 +313,8 @@ int FS_CacheBase::scan(FsQuery const& query, PathDrive& path, RecordSet& directo
         info.setFilePath(prefix);
         void* wideBlock = wideNameBuffer;
         size_t nameLength = 0;
-        if (growScratch(&wideBlock, &wideNameBufferSize, entryBytes + 1, sizeof(wchar_t))) {
+        bool reserved = growScratch(&wideBlock, &wideNameBufferSize, entryBytes + 1, sizeof(wchar_t));
+        if (reserved) {
             wideNameBuffer = static_cast<wchar_t*>(wideBlock);
             size_t n = mbstowcs(wideNameBuffer, entryName, wideNameBufferSize);
             if (n == static_cast<size_t>(-1) || n >= wideNameBufferSize)
@@ -292,15 +325,33 @@ int FS_CacheBase::scan(FsQuery const& query, PathDrive& path, RecordSet& directo
         if (nameLength == 0) {
             log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - file name len is 0. file skipped!",
                           className, __func__);
+            if (reserved)
+                statistics.addSkipped(FsQueryStatistics::SKIP_UNDECODABLE_NAME,
+                                      directoryBytes.c_str(), entryName, 0);
             kelm_free(entry);
             continue;
         }
         info.setFileName(wideNameBuffer);
-        info.updateInfo();  // a failed status call leaves attr 0: a file
+        bool known = info.updateInfo();  // a failed status call leaves attr 0: a file
         unsigned int attr = info.getAttr();
+        // An entry without status is stored as a file, and nothing below it is
+        // read: past the system's 4095 bytes, or refused (a directory that may
+        // be listed but not searched), or gone since the listing.  "." and
+        // ".." are no entries of their own.
+        bool dotName = wcscmp(wideNameBuffer, L".") == 0 || wcscmp(wideNameBuffer, L"..") == 0;
+        if (!known && !dotName) {
+            if (prefixLength + nameLength > SCAN_MAX_PATH ||
+                directoryBytes.size() + 1 + entryBytes > SCAN_MAX_PATH)
+                statistics.addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, directoryBytes.c_str(),
+                                      entryName, 0);
+            else
+                statistics.addSkipped(FsQueryStatistics::SKIP_NO_STATUS, directoryBytes.c_str(),
+                                      entryName, statusError(directoryBytes, entryName));
+        }
 
         if ((attr & FsFileInfo::ATTR_DIRECTORY) == 0) {
             if (included && !excluded) {
+                statistics.addFile();
                 ++filesScanned;
                 if (filesScanned % CpuThreshold::CPU_THROTTLE_NO_OF_SCANNED_FILES_FACTOR == 0)
                     CpuThreshold::doIteration();
@@ -344,6 +395,8 @@ int FS_CacheBase::scan(FsQuery const& query, PathDrive& path, RecordSet& directo
         if (prefixLength + nameLength > SCAN_MAX_PATH) {
             log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - '%S' path too long!", className,
                           __func__, wideNameBuffer);
+            statistics.addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, directoryBytes.c_str(),
+                                  entryName, 0);
             kelm_free(entry);
             continue;
         }
@@ -363,6 +416,7 @@ int FS_CacheBase::scan(FsQuery const& query, PathDrive& path, RecordSet& directo
         directories.insert();
 
         PathDrive child(prefix, recursive, static_cast<DriveInfo const&>(path));
+        statistics.addDirectory();
         ++directoriesScanned;
         kelm_free(entry);
         int remaining = timeoutMs - static_cast<int>(utils::getTickCount() - start);

@@ -84,6 +84,16 @@ FS_Table* damagedTable(FS_Table* files, FS_Table* directories)
     return nullptr;
 }
 
+// The first of the two tables that refused a write, or null.
+FS_Table* refusingTable(FS_Table* files, FS_Table* directories)
+{
+    if (files != nullptr && files->writeFailed())
+        return files;
+    if (directories != nullptr && directories->writeFailed())
+        return directories;
+    return nullptr;
+}
+
 }  // namespace
 
 // --- ExcludeMD5 -------------------------------------------------------------
@@ -234,6 +244,7 @@ FS_CacheBase::FS_CacheBase(wchar_t const* directoriesTable, wchar_t const* files
 FS_CacheBase::~FS_CacheBase()
 {
     deleteObjects();
+    forgetQueryStatistics();
 }
 
 void FS_CacheBase::initObjects()
@@ -445,6 +456,9 @@ int FS_CacheBase::create(unsigned int timeout, int creationDisposition)
         break;
     }
     int result = CACHE_ERROR;
+    // The reason the tables could not be made, for the caller: the checks of
+    // the directory and the reading of the marks below must not replace it.
+    int reason = errno;
     if (ok) {
         log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - retValue is SUCCESS", className,
                       __func__);
@@ -454,6 +468,8 @@ int FS_CacheBase::create(unsigned int timeout, int creationDisposition)
         traceCacheDirectoryProblem();
     }
     readMd5OfExclude();
+    if (result != SUCCESS)
+        errno = reason;
     return result;
 }
 
@@ -578,6 +594,9 @@ std::string narrowName(wchar_t const* name)
 // of only the one about a damaged cache.
 void FS_CacheBase::traceCacheDirectoryProblem()
 {
+    // Called right after the failure: errno is still the reason of the
+    // write that failed, if one did.
+    int reason = errno;
     if (cachePathName == nullptr)
         return;
     std::string directory = narrowName(cachePathName);
@@ -592,6 +611,9 @@ void FS_CacheBase::traceCacheDirectoryProblem()
     } else if (access(directory.c_str(), W_OK | X_OK) != 0) {
         error = errno;
         problem = "is not writable";
+    } else if (reason == ENOSPC || reason == EDQUOT) {
+        error = reason;
+        problem = "is on a full file system";
     }
     if (problem == nullptr)
         return;
@@ -677,13 +699,26 @@ bool FS_CacheBase::updateDirectoriesIDCounter()
     wchar_t* name = getCacheFileName(cachePathName, directoriesTableName, L".counter");
     if (name == nullptr)
         return false;
-    FILE* f = fopen(narrowName(name).c_str(), "wb");
+    std::string path = narrowName(name);
     delete[] name;
+    // An existing counter is overwritten in place: its four bytes already
+    // have their block, so a full disk cannot leave it cut short, which
+    // would make the next open refuse (and remove) the whole cache.  Only a
+    // missing one is made anew.
+    FILE* f = fopen(path.c_str(), "r+b");
+    if (f == nullptr)
+        f = fopen(path.c_str(), "wb");
     if (f == nullptr)
         return false;
     uint32_t value = directoriesIndex;
-    bool ok = fwrite(&value, 1, 4, f) == 4;
+    bool ok = fwrite(&value, 1, 4, f) == 4 && fflush(f) == 0;
+    // A longer file (not one of ours) is cut to the four bytes, as a new one
+    // would be.
+    ok = ok && ftruncate(fileno(f), 4) == 0;
+    int reason = errno;
     ok = fclose(f) == 0 && ok;
+    if (!ok)
+        errno = reason;
     return ok;
 }
 
@@ -838,6 +873,7 @@ void FS_CacheBase::writeMd5File()
     FILE* f = fopen(path, "wb");
     if (f == nullptr)
         return;
+    bool written = true;
     for (std::map<std::string, ExcludeMD5>::const_iterator it = excludeMd5.begin();
          it != excludeMd5.end(); ++it) {
         log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - md5 write of '%s'", className,
@@ -845,11 +881,22 @@ void FS_CacheBase::writeMd5File()
         if (!it->second.valid)
             continue;
         uint32_t length = static_cast<uint32_t>(it->first.size());
-        fwrite(&length, 1, cachemarks::RECORD_LENGTH_SIZE, f);
-        fwrite(it->first.data(), 1, it->first.size(), f);
-        fwrite(it->second.digest, 1, cachemarks::DIGEST_SIZE, f);
+        written = written && fwrite(&length, 1, cachemarks::RECORD_LENGTH_SIZE, f) ==
+                                 cachemarks::RECORD_LENGTH_SIZE;
+        written = written && fwrite(it->first.data(), 1, it->first.size(), f) == it->first.size();
+        written = written && fwrite(it->second.digest, 1, cachemarks::DIGEST_SIZE, f) ==
+                                 cachemarks::DIGEST_SIZE;
     }
-    fclose(f);
+    written = fflush(f) == 0 && written;
+    int reason = errno;
+    written = fclose(f) == 0 && written;
+    // A file cut short by a full disk holds only whole records before the
+    // cut, which the reader keeps; the roots whose records are missing count
+    // as built under other excludes and are rebuilt.  That is the promise of
+    // a missing mark, so no wrong tree is served: the failure is traced only.
+    if (!written)
+        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - cannot write '%s': %s", className,
+                      __func__, path, strerror(reason));
 }
 
 void FS_CacheBase::readMd5OfExclude()
@@ -902,10 +949,12 @@ int FS_CacheBase::executeQueryEx(FsResultSetWriter& writer, FsQuery const& query
                   "%s::%s called with: query: '%S', timeout=%d, maxCacheAge=%d", className, __func__,
                   query.getQuery() != nullptr ? query.getQuery() : L"", static_cast<int>(timeout),
                   static_cast<int>(maxCacheAge));
+    queryStatistics().reset();
     if (!cacheInitialized || !cacheOpened || cacheUnusable)
         return CACHE_UNUSABLE;
     unsigned int indexBefore = directoriesIndex;
     int result = executeQueryCacheOnlyEx(writer, query, timeout, maxCacheAge);
+    int reason = errno;  // of a CACHE_ERROR, given back to the caller
     // A read that met damage ended its walk early: what the writer got is
     // not the answer, whatever the flow returned.
     if (FS_Table* damaged = damagedTable(tbFiles, tbDirectories)) {
@@ -917,11 +966,22 @@ int FS_CacheBase::executeQueryEx(FsResultSetWriter& writer, FsQuery const& query
         cacheUnusable = true;
         return result;
     }
-    if (result == SUCCESS) {
-        if (directoriesIndex > indexBefore)
-            updateDirectoriesIDCounter();
-        return SUCCESS;
+    // A refused build took its own rows back, but roots built before it in
+    // this query keep theirs: the counter must cover their ids, or the next
+    // open would find ids it never gave and refuse the whole cache.
+    if ((result == SUCCESS || result == CACHE_ERROR) && directoriesIndex > indexBefore &&
+        !updateDirectoriesIDCounter()) {
+        int counterReason = errno;
+        log->traceMIN(__LINE__, __FILE__, __func__,
+                      "%s::%s - cannot save the directory id counter: %s", className, __func__,
+                      strerror(counterReason));
+        if (result == SUCCESS) {
+            result = CACHE_ERROR;
+            reason = counterReason;
+        }
     }
+    if (result == CACHE_ERROR)
+        errno = reason;
     return result;
 }
 
@@ -1083,9 +1143,11 @@ int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery con
                 pathHelper.fillExclude(root, excludeResolved, remoteExcludePaths);
                 int rc;
                 {
+                    FsQueryStatistics& statistics = queryStatistics();
+                    ++statistics.rootsWalked;
                     FileProcessor processor(query.getQuery(), caseFlag);
                     rc = fs_build(writer, processor, root, remoteIncludePaths, remoteExcludePaths,
-                                  caseFlag, 2000000000);
+                                  caseFlag, 2000000000, &statistics);
                 }
                 // The walk's commands are gone with its processor; their names
                 // must not stay in the shared table, where they would change
@@ -1102,8 +1164,16 @@ int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery con
 
             int rc = visitLocalRoot(query, root, pathHelper, caseFlag, timeout, maxCacheAge, now,
                                     cacheValid);
+            if (rc == -1)
+                ++queryStatistics().rootsFromCache;
+            else
+                ++queryStatistics().rootsRebuilt;
             if (rc == 2)
                 return BUILD_TIMED_OUT;
+            // errno is the reason, from visitLocalRoot: nothing may run here
+            // that could change it.
+            if (rc == 3)
+                return CACHE_ERROR;
             if (rc != -1)
                 anyBuilt = true;
         }
@@ -1218,11 +1288,31 @@ int FS_CacheBase::visitLocalRoot(FsQuery const& query, PathDrive& root, PathHelp
                       "%s::%s - Failed to open file to store scanned directories list, errno=%d",
                       className, driverName, errno);
 
+    // Every row this build writes has an id above this one.
+    unsigned int lastKeptId = directoriesIndex;
+    tbFiles->clearWriteFailure();
+    tbDirectories->clearWriteFailure();
     int rc = build(query, pathDrive, *directoriesCursor, directoriesIndex, *filesCursor,
                    *directoriesCursor2, scanIncludePaths, scanExcludePaths, caseFlag,
                    static_cast<int>(timeout));
     if (folderLog != nullptr)
         fflush(folderLog);
+
+    // A table that refused a write (a full disk) refused every row after it
+    // too, so the tree is incomplete whatever the walk returned: its rows go
+    // again, and the rest of the cache stays as it was before this root.
+    if (FS_Table* refused = refusingTable(tbFiles, tbDirectories)) {
+        int reason = refused->writeError();
+        log->traceMIN(__LINE__, __FILE__, __func__,
+                      "IMPORTANT: %s::%s - (WRITE FAILED) cannot write the cache file '%ls' while building '%S': %s; the rows of this build are removed",
+                      className, driverName, refused->failedWriteFile(), rootPath,
+                      reason != 0 ? strerror(reason) : "unknown reason");
+        removeRowsAbove(lastKeptId);
+        tbFiles->clearWriteFailure();
+        tbDirectories->clearWriteFailure();
+        errno = reason;
+        return 3;
+    }
 
     if (rc == 0) {
         updateMd5OfExclude(scanExcludePaths, rootPath);
@@ -1244,6 +1334,28 @@ int FS_CacheBase::visitLocalRoot(FsQuery const& query, PathDrive& root, PathHelp
                   "IMPORTANT: (ACCESS FAILED) File system access on '%S' (drive: '%S', type: %d, fs: '%S')",
                   rootPath, driveName, driveType, driveFs);
     return 1;
+}
+
+void FS_CacheBase::removeRowsAbove(unsigned int lastKeptId)
+{
+    if (tbDirectories == nullptr || tbFiles == nullptr)
+        return;
+    // Ids of removed rows must not be answered from the memo any more.
+    clearPathMemo();
+    // By id, not by walking down from the root: a directory row the disk
+    // refused leaves its files and subdirectories unreachable.  Removal only
+    // zeroes slots and rewrites counts in place.
+    RecordSet set = tbDirectories->openRecordSet();
+    for (unsigned int id = lastKeptId + 1; id > lastKeptId && id <= directoriesIndex; ++id) {
+        removeFiles(tbFiles, id);
+        for (bool row = lookUp(set, cachetables::CRIT_ID, L"ID", cachetables::VAR_ID, id, nullptr,
+                               true);
+             row; row = set.moveNext())
+            set.remove();
+    }
+    if (!tbDirectories->closeRecordSet(set))
+        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - closeRecordSet failed!", className,
+                      __func__);
 }
 
 int FS_CacheBase::extractFromCache(FsResultSetWriter& writer, FsQuery const& query,

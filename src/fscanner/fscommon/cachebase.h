@@ -12,6 +12,7 @@
 
 #include "fscanner/fs/fs_fileinfo.h"
 #include "fscanner/fscommon/expvalue.h"
+#include "fscanner/fscommon/querystats.h"
 
 class AbstractMutex;
 class FS_Table;
@@ -129,14 +130,31 @@ public:
 
     // --- query driver ---
     // The entry: -40 at once on an uninitialised, unopened or unusable cache;
-    // a -40 or -42 from the flow latches cacheUnusable.
+    // a -40 or -42 from the flow latches cacheUnusable.  CACHE_ERROR (-53):
+    // the disk refused a write to the cache (full, over quota, a table past
+    // its 32-bit size).  The rows of the root being built are removed again,
+    // the other roots stay and are served by later queries, nothing of this
+    // query is served, the cache is not latched, and errno holds the
+    // system's reason.
     int executeQueryEx(FsResultSetWriter& writer, FsQuery const& query, unsigned int timeout,
                        unsigned int maxCacheAge);
     int executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery const& query,
                                 unsigned int timeout, unsigned int maxCacheAge);
+    // What the last executeQueryEx of this object did: roots served, rebuilt
+    // and walked, files and directories scanned, hits, the lookup, and the
+    // entries its walks left out by cause.  Emptied when executeQueryEx
+    // starts.  A query that repeats the paths of this object's last one
+    // visits no root, and its root counts stay 0.  Entries left out when a
+    // tree was built are told by the query that built it, not by the later
+    // ones that are served from it.  The record belongs to the object and
+    // lives as long as it; another thread may read its entriesScanned()
+    // while a query runs.
+    FsQueryStatistics const& lastQueryStatistics() const;
 
     // --- lifecycle ---
     // 0, CACHE_ALREADY_OPENED (-51) or CACHE_ERROR (-53); timeout is only traced.
+    // After a CACHE_ERROR of a cache whose tables could not be made, errno
+    // holds the system's reason (ENOSPC on a full disk, EACCES, ...).
     int create(unsigned int timeout, int creationDisposition);
     int lock();
     int lock(int timeout);
@@ -290,8 +308,13 @@ public:
     wchar_t* catSetFileName;
 
 private:
+    // The record behind lastQueryStatistics, made on first use; the walks
+    // of the query write to it.  forgetQueryStatistics drops it (destructor).
+    FsQueryStatistics& queryStatistics() const;
+    void forgetQueryStatistics();
     // Traces why the cache directory cannot hold a cache (missing, not a
-    // directory, not writable), naming it; nothing when it looks usable.
+    // directory, not writable, or, by errno, on a full file system), naming
+    // it; nothing when it looks usable.
     void traceCacheDirectoryProblem();
     // Points set at the rows whose column equals a value, through the hash
     // index: the column and value go into hashValue, the value into the
@@ -301,7 +324,9 @@ private:
                 unsigned int number, wchar_t const* text, bool caseSensitive);
     // Decides one local root of a query and rebuilds it when the cache may
     // not serve it: -1 served from the cache, 0 built, 2 build timed out,
-    // 1 build failed otherwise.  cacheValid carries over to the next root.
+    // 3 a table refused a write (the build's rows are removed again and
+    // errno is its reason), 1 build failed otherwise.  cacheValid carries
+    // over to the next root.
     int visitLocalRoot(FsQuery const& query, PathDrive& root, PathHelper& pathHelper,
                        bool caseFlag, unsigned int timeout, unsigned int maxCacheAge,
                        time_t now, bool& cacheValid);
@@ -309,6 +334,10 @@ private:
     // that last ran.
     int extractFromCache(FsResultSetWriter& writer, FsQuery const& query, PathHelper& pathHelper,
                          bool caseFlag, unsigned int timeout);
+    // Removes every directory row with an id above lastKeptId and every file
+    // row of those directories: all that a build which began at that id
+    // wrote, reachable from its root or not.  Needs no disk space.
+    void removeRowsAbove(unsigned int lastKeptId);
     bool createTables();
     // Opens the files cursor and both directories cursors on the open tables;
     // dropCursors forgets the handles (the tables own the cursors).

@@ -1,6 +1,7 @@
 #include "fscanner/fscommon/cachetables.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <cwchar>
 #include <string>
 #include <vector>
@@ -58,7 +59,11 @@ bool createTable(FS_Table** slot, wchar_t const* name, wchar_t const* dir, bool 
         ok = table->addField(columns[i], types[i]);
     ok = ok && table->create();
     if (!ok) {
+        // The reason of the failed create (a full disk, say) stays in errno
+        // for the caller: the lock file's removal must not replace it.
+        int reason = errno;
         delete table;
+        errno = reason;
         return false;
     }
     // A missing index is not fatal: lookups on that column then walk the

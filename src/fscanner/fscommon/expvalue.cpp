@@ -186,9 +186,10 @@ bool checkSimpleExpression(wchar_t const* value, unsigned int relop, wchar_t con
     }
 }
 
-// Sets the analyzer's failure flag, traces one line and yields false.
+// Sets the analyzer's failure flag, keeps its text, traces one line and
+// yields false.
 #define FS_SA_FAIL(...)                                                                 \
-    (error = true,                                                                       \
+    (error = true, noteError(QvLogWrapper::format(__VA_ARGS__)),                         \
      trace != nullptr ? trace->traceMAX(__LINE__, __FILE__, __FUNCTION__, __VA_ARGS__)   \
                       : (void)0,                                                         \
      false)

@@ -7,6 +7,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <new>
+#include <string>
 #include <vector>
 
 #include "base/QvLogWrapper.h"
@@ -73,6 +74,17 @@ bool narrowFullPath(const wchar_t* path, const wchar_t* name, char* out) {
     size_t more = wcstombs(out + used, name, kNarrowPathBytes - used);
     if (more == static_cast<size_t>(-1) || used + more >= kNarrowPathBytes) return false;
     return true;
+}
+
+// Why the status of directory/name cannot be read, for the statistics: the
+// status call is made again, as the first one's errno may be gone.  0 when it
+// now succeeds.
+int statusError(const std::string& directory, const char* name) {
+    std::string path = directory;
+    if (path.empty() || path.back() != '/') path += '/';
+    path += name;
+    struct stat status;
+    return lstat(path.c_str(), &status) == 0 ? 0 : errno;
 }
 
 // Decides, for one directory of a "dfs" tree, whether its files are recorded.
@@ -170,42 +182,56 @@ bool fs_isValidPath(wchar_t* path) {
     return S_ISDIR(status.st_mode);
 }
 
-int scandir(const char* path, dirent*** namelist) {
+int scandir(const char* path, dirent*** namelist) { return fs_readDirectory(path, namelist, nullptr); }
+
+int fs_readDirectory(const char* path, dirent*** namelist, int* error) {
     QvLogWrapper* log = getQvLogFs();
+    int ignored = 0;
+    if (error == nullptr) error = &ignored;
+    *error = 0;
     if (path == nullptr || namelist == nullptr) return -1;
     *namelist = nullptr;
     DIR* dir = opendir(path);
     if (dir == nullptr) {
-        int error = errno;
-        log->traceMIN(__LINE__, __FILE__, __FUNCTION__, "::scandir CAN'T OPEN %s dir, errno: %u ('%s')",
-                      path, static_cast<unsigned int>(error), strerror(error));
+        *error = errno;
+        log->traceMIN(__LINE__, __FILE__, "scandir", "::scandir CAN'T OPEN %s dir, errno: %u ('%s')",
+                      path, static_cast<unsigned int>(*error), strerror(*error));
         return -1;
     }
     int count = 0;
     for (;;) {
+        // readdir gives null at the end and on an error; only errno tells.
+        errno = 0;
         struct dirent* entry = readdir(dir);
-        if (entry == nullptr) break;
+        if (entry == nullptr) {
+            *error = errno;
+            break;
+        }
         dirent** grown = static_cast<dirent**>(
             kelm_realloc(*namelist, static_cast<size_t>(count + 1) * sizeof(dirent*)));
         if (grown == nullptr) {
-            log->traceMAX(__LINE__, __FILE__, __FUNCTION__, "::scandir - *namelist == NULL!\n");
+            log->traceMAX(__LINE__, __FILE__, "scandir", "::scandir - *namelist == NULL!\n");
             // The entries read so far stay in *namelist; the handle is closed
             // so that a failing walk does not also leak descriptors.
             closedir(dir);
+            *error = ENOMEM;
             return -1;
         }
         *namelist = grown;
         dirent* copy = static_cast<dirent*>(kelm_malloc(entry->d_reclen));
         if (copy == nullptr) {
-            log->traceMAX(__LINE__, __FILE__, __FUNCTION__, "::scandir - (*namelist)[i] == NULL!\n");
+            log->traceMAX(__LINE__, __FILE__, "scandir", "::scandir - (*namelist)[i] == NULL!\n");
             closedir(dir);
+            *error = ENOMEM;
             return -1;
         }
         std::memcpy(copy, entry, entry->d_reclen);
         (*namelist)[count] = copy;
         ++count;
     }
+    errno = 0;
     if (closedir(dir) != 0 || count == 0) {
+        if (*error == 0) *error = errno;
         for (int i = 0; i < count; ++i) kelm_free((*namelist)[i]);
         kelm_free(*namelist);
         *namelist = nullptr;
@@ -217,6 +243,12 @@ int scandir(const char* path, dirent*** namelist) {
 int fs_build(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& root,
              std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
              int timeoutMs) {
+    return fs_build(writer, processor, root, includes, excludes, caseSensitive, timeoutMs, nullptr);
+}
+
+int fs_build(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& root,
+             std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
+             int timeoutMs, FsQueryStatistics* statistics) {
     QvLogWrapper* log = getQvLogFs();
     wchar_t* rootPath = root.getPathName();
     if (!excludes.empty() && checkPathList(rootPath, excludes, caseSensitive, root.getRecursive())) {
@@ -229,12 +261,18 @@ int fs_build(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& roo
                       rootPath != nullptr ? rootPath : L"");
         return FS_SCAN_DONE;
     }
-    return fs_scan(writer, processor, root, includes, excludes, caseSensitive, timeoutMs);
+    return fs_scan(writer, processor, root, includes, excludes, caseSensitive, timeoutMs, statistics);
 }
 
 int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& pathDrive,
             std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
             int timeoutMs) {
+    return fs_scan(writer, processor, pathDrive, includes, excludes, caseSensitive, timeoutMs, nullptr);
+}
+
+int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& pathDrive,
+            std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
+            int timeoutMs, FsQueryStatistics* statistics) {
     QvLogWrapper* log = getQvLogFs();
     PathInfo pathInfo(pathDrive);
     FileChecksumInfo checksums;
@@ -250,6 +288,7 @@ int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& path
     size_t pathLength = wcslen(path);
     if (pathLength > kMaxPath) {
         log->traceMID(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - '%S' path too long\n", path);
+        if (statistics != nullptr) statistics->addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, path, 0);
         return FS_SCAN_DONE;
     }
 
@@ -259,6 +298,11 @@ int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& path
     size_t converted = wcstombs(narrowPath, path, narrowPathCapacity);
     if (converted == static_cast<size_t>(-1) || converted >= narrowPathCapacity) {
         log->traceMID(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - '%S' path can't be converted\n", path);
+        if (statistics != nullptr) {
+            statistics->addSkipped(converted == static_cast<size_t>(-1) ? FsQueryStatistics::SKIP_UNDECODABLE_NAME
+                                                                       : FsQueryStatistics::SKIP_PATH_TOO_LONG,
+                                   path, 0);
+        }
         return FS_SCAN_DONE;
     }
 
@@ -273,11 +317,24 @@ int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& path
     size_t includeCount = includes.size();
     size_t excludeCount = excludes.size();
     dirent** entries = nullptr;
-    int entryCount = scandir(narrowPath, &entries);
+    int readError = 0;
+    int entryCount = fs_readDirectory(narrowPath, &entries, &readError);
     if (entryCount < 0) {
         log->traceMID(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - scandir error opening '%s' path!\n",
                       narrowPath);
+        if (statistics != nullptr) {
+            statistics->addSkipped(FsQueryStatistics::SKIP_UNREADABLE_DIRECTORY, narrowPath, nullptr, readError);
+        }
         return FS_SCAN_DONE;
+    }
+    // The shared narrow buffer is reused by the recursion: skipped entries
+    // of this directory are named from a copy.
+    std::string directoryBytes;
+    if (statistics != nullptr) {
+        directoryBytes = narrowPath;
+        if (readError != 0) {
+            statistics->addSkipped(FsQueryStatistics::SKIP_UNREADABLE_DIRECTORY, narrowPath, nullptr, readError);
+        }
     }
     unsigned int start = getTickCount();
 
@@ -305,7 +362,8 @@ int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& path
         const char* entryName = entry->d_name;
         size_t entryBytes = std::strlen(entryName);
         size_t nameLength = 0;
-        bool converted = reserveWide(entryBytes + 1);
+        bool reserved = reserveWide(entryBytes + 1);
+        bool converted = reserved;
         if (converted) {
             size_t n = mbstowcs(wideName, entryName, wideNameCapacity);
             converted = n != static_cast<size_t>(-1) && n > 0 && n < wideNameCapacity;
@@ -313,11 +371,21 @@ int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& path
         }
         if (!converted) {
             log->traceMID(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - file name len is 0. file skipped!\n");
+            if (statistics != nullptr && reserved) {
+                statistics->addSkipped(FsQueryStatistics::SKIP_UNDECODABLE_NAME, directoryBytes.c_str(),
+                                       entryName, 0);
+            }
             kelm_free(entry);
             continue;
         }
-        if (wcscmp(wideName, L".") == 0 || wcscmp(wideName, L"..") == 0 ||
-            nameLength + dirLength > kMaxPath) {
+        if (wcscmp(wideName, L".") == 0 || wcscmp(wideName, L"..") == 0) {
+            kelm_free(entry);
+            continue;
+        }
+        if (nameLength + dirLength > kMaxPath) {
+            if (statistics != nullptr) {
+                statistics->addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, directoryBytes.c_str(), entryName, 0);
+            }
             kelm_free(entry);
             continue;
         }
@@ -333,8 +401,19 @@ int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& path
         }
 
         info.setFileName(wideName);
-        info.updateInfo();  // a failure leaves attr 0: the entry is then a file
+        bool known = info.updateInfo();  // a failure leaves attr 0: the entry is then a file
         unsigned int attr = info.getAttr();
+        // An entry without status goes on as a file, and nothing below it is
+        // read: past the system's 4095 bytes, or refused (a directory that
+        // may be listed but not searched), or gone since the listing.
+        if (!known && statistics != nullptr) {
+            if (directoryBytes.size() + 1 + entryBytes > kMaxPath) {
+                statistics->addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, directoryBytes.c_str(), entryName, 0);
+            } else {
+                statistics->addSkipped(FsQueryStatistics::SKIP_NO_STATUS, directoryBytes.c_str(), entryName,
+                                       statusError(directoryBytes, entryName));
+            }
+        }
 
         int subResult = FS_SCAN_DONE;
         if (attr & FsFileInfo::ATTR_DIRECTORY) {
@@ -344,12 +423,14 @@ int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& path
                                   work);
                 } else {
                     PathDrive child(work, recursive, static_cast<const DriveInfo&>(pathDrive));
+                    if (statistics != nullptr) statistics->addDirectory();
                     int remaining = timeoutMs - static_cast<int>(getTickCount() - start);
                     subResult = fs_scan(writer, processor, child, includes, excludes, caseSensitive,
-                                        remaining);
+                                        remaining, statistics);
                 }
             }
         } else if (dirIncluded && !dirExcluded) {
+            if (statistics != nullptr) statistics->addFile();
             unsigned int wanted = processor.processingFlags;
             if (wanted & (FileProcessor::PROCESS_MD5 | FileProcessor::PROCESS_CRC32 |
                           FileProcessor::PROCESS_Q32)) {
@@ -369,6 +450,7 @@ int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& path
             }
             if (processor.satisfyCriteria(info, checksums, nullptr) && (!onDfs || dfsAdd)) {
                 writer.addRecord(info);
+                if (statistics != nullptr) statistics->addHit();
             }
         }
         kelm_free(entry);

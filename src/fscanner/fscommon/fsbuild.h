@@ -18,6 +18,7 @@
 #include "fscanner/fs/fs_fileinfo.h"
 #include "fscanner/fs/fs_resultset.h"
 #include "fscanner/fscommon/fields.h"
+#include "fscanner/fscommon/querystats.h"
 
 struct FileChecksumInfo;
 class CriteriaEvaluator;
@@ -196,6 +197,19 @@ int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& path
             std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
             int timeoutMs);
 
+// The same two walks, telling statistics (not owned; null for none) what
+// they did: files offered to the processor, directories entered below the
+// root, records written, and every entry left out by cause (an unreadable
+// directory, a name the locale cannot convert, a path past 4095 characters).
+// The counts add to what the record holds; roots and the lookup are the
+// caller's to fill.  Results and traces are those of the forms above.
+int fs_build(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& root,
+             std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
+             int timeoutMs, FsQueryStatistics* statistics);
+int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& path,
+            std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
+            int timeoutMs, FsQueryStatistics* statistics);
+
 // True only for an existing real directory (lstat: a link to one is false).
 bool fs_isValidPath(wchar_t* path);
 
@@ -216,6 +230,19 @@ int scandir(const char* path, dirent*** namelist)
     __attribute__((error("scandir(path, namelist) needs _FILE_OFFSET_BITS=64 on this target")));
 #else
 int scandir(const char* path, dirent*** namelist);
+#endif
+
+// scandir that also says why a directory could not be read: *error (may be
+// null) is 0, or the errno of the failed open, of a read that broke off part
+// way, or of the close.  A read that broke off keeps what it read and
+// returns it as scandir does; every other result is scandir's.  The walks
+// read their directories through it.  The entries have the layout above.
+#if defined(__SIZEOF_POINTER__) && __SIZEOF_POINTER__ == 4 && \
+    (!defined(_FILE_OFFSET_BITS) || _FILE_OFFSET_BITS != 64)
+int fs_readDirectory(const char* path, dirent*** namelist, int* error)
+    __attribute__((error("fs_readDirectory needs _FILE_OFFSET_BITS=64 on this target")));
+#else
+int fs_readDirectory(const char* path, dirent*** namelist, int* error);
 #endif
 
 #endif

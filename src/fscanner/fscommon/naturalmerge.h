@@ -7,6 +7,10 @@
 // order are kept as they stand: a sorted file takes one pass, and the number
 // of passes is about the binary logarithm of the number of natural runs.
 //
+// The sorter reads and writes its files in large pieces and never syncs
+// them: they are scratch, read back at once.  The callbacks see the rules of
+// a LinuxMmFile (see the .cpp).
+//
 // Scratch files are the file's name followed by ".a" and ".b".  While a pass
 // stands between re-creating the file and the end of its merge, the records
 // not yet merged back exist only in the scratch files; a crash there loses
@@ -23,9 +27,19 @@
 #ifndef FSCANNER_FSCOMMON_NATURALMERGE_H
 #define FSCANNER_FSCOMMON_NATURALMERGE_H
 
+#include <cstdint>
 #include <cwchar>
+#include <vector>
 
 class AbstractFile;
+
+// The scratch files of a sort are the sorted file's name followed by these
+// (in the forms of the two kinds of name).  Whoever removes a file that may be
+// in the middle of a sort removes these too.
+const char* const NATURAL_MERGE_SCRATCH_A = ".a";
+const char* const NATURAL_MERGE_SCRATCH_B = ".b";
+const wchar_t* const NATURAL_MERGE_SCRATCH_A_WIDE = L".a";
+const wchar_t* const NATURAL_MERGE_SCRATCH_B_WIDE = L".b";
 
 class NaturalMergeSort {
 public:
@@ -97,6 +111,59 @@ private:
     // Operator that, holding between the two heads of a merge, picks side a.
     unsigned int mergeOperator;
     bool caseFlag;
+};
+
+// The passes of NaturalMergeSort::sort, replayed in memory.
+//
+// Where the records end up, ties included, and how many runs each pass
+// merges follow from the sequence of records and the outcomes of the compare
+// callback alone.  A caller that can give every record a number that compares
+// as the callback compares the records (equal numbers for records the
+// callback finds equal) gets that order from here without any scratch file,
+// and writes its file once instead of reading and writing it twice per pass.
+// The traces are sort()'s: "entering" with the file name, one line per pass
+// with the runs it merged, and the same bound on the number of passes.
+//
+// Memory: 20 bytes per record besides the caller's records (36 when a key
+// number needs more than 32 bits), all of it reserved before the first trace.  Callers keep to files they may hold in memory (see limitBytes) and
+// give larger ones to NaturalMergeSort::sort.
+class NaturalMergeReplay {
+public:
+    // A record as the first pass reads it from the file.  The key numbers
+    // need not be dense; see keysMayBeMissing for MISSING_KEY.
+    struct Record {
+        // Its number as read from the file: it decides where the first
+        // distribution ends runs.
+        uint64_t keyInFile;
+        // Its number as read back after the write callback wrote it; the
+        // same as keyInFile for a record that the write leaves unchanged.
+        uint64_t keyWritten;
+        // The caller's number for the record.
+        uint32_t id;
+        // False when the write callback refuses the record: it still takes
+        // part in the first distribution's run ends, and is not in the result.
+        bool written;
+    };
+
+    // With keysMayBeMissing, the number of a record whose key is missing:
+    // every operator compares false with it on either side, as the callbacks
+    // treat a record without its key.  Otherwise an ordinary number.
+    static constexpr uint64_t MISSING_KEY = ~static_cast<uint64_t>(0);
+
+    // Replays sort(file, order, ...) over records, given in file order; file
+    // serves only the traces.  order is 1 ascending or 2 descending (anything
+    // else returns false at once, after the "entering" trace, as sort()
+    // does).  result receives the ids in the order the sort leaves in the
+    // file.  False, with result holding the order of the last pass, when the
+    // bound on passes ended the sort as it ends sort().  May throw
+    // std::bad_alloc before the first trace, never after it.
+    static bool sort(const wchar_t* file, unsigned int order, bool keysMayBeMissing,
+                     const std::vector<Record>& records, std::vector<uint32_t>& result);
+
+    // Size in bytes up to which a result file is sorted in memory.  For tests
+    // of the passes on disk; not thread-safe.
+    static uint32_t limitBytes();
+    static void setLimitBytes(uint32_t bytes);
 };
 
 #endif

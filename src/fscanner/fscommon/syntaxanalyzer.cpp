@@ -1,15 +1,19 @@
 #include "fscanner/fscommon/syntaxanalyzer.h"
 
 #include <cwchar>
+#include <map>
+#include <mutex>
+#include <string>
 
 #include "base/QvLogWrapper.h"
 #include "fscanner/fscommon/fields.h"
 #include "fscanner/fscommon/wildcard.h"
 
-// Sets the analyzer's failure flag and traces one line.
+// Sets the analyzer's failure flag, keeps its text and traces one line.
 #define FS_SA_FAIL(...)                                                              \
     do {                                                                             \
         error = true;                                                                \
+        noteError(QvLogWrapper::format(__VA_ARGS__));                                \
         if (trace != nullptr) {                                                      \
             trace->traceMAX(__LINE__, __FILE__, __FUNCTION__, __VA_ARGS__);          \
         }                                                                            \
@@ -127,6 +131,19 @@ void Tree::free(TreeNode* node) {
 
 // ---------------------------------------------------------------- SyntaxAnalyzer
 
+namespace {
+
+// Failure texts of the analyzers, by analyzer (see noteError).  Never
+// destroyed: an analyzer of static storage may outlive it otherwise.
+std::mutex errorTextsLock;
+
+std::map<const SyntaxAnalyzer*, std::string>& errorTexts() {
+    static auto* texts = new std::map<const SyntaxAnalyzer*, std::string>();
+    return *texts;
+}
+
+}  // namespace
+
 SyntaxAnalyzer::SyntaxAnalyzer()
     : lexer(new Lexer()),
       error(false),
@@ -146,6 +163,26 @@ SyntaxAnalyzer::SyntaxAnalyzer()
 SyntaxAnalyzer::~SyntaxAnalyzer() {
     delete tree;
     delete lexer;
+    std::lock_guard<std::mutex> guard(errorTextsLock);
+    errorTexts().erase(this);
+}
+
+void SyntaxAnalyzer::noteError(std::string const& message) {
+    std::string text = message;
+    size_t head = text.find(" - ");
+    if (head != std::string::npos && text.find("::") < head) {
+        text.erase(0, head + 3);
+    }
+    while (!text.empty() && (text.back() == '\n' || text.back() == ' ')) text.pop_back();
+    std::lock_guard<std::mutex> guard(errorTextsLock);
+    errorTexts()[this] = text;
+}
+
+std::string SyntaxAnalyzer::getErrorText() const {
+    if (!error) return std::string();
+    std::lock_guard<std::mutex> guard(errorTextsLock);
+    std::map<const SyntaxAnalyzer*, std::string>::const_iterator found = errorTexts().find(this);
+    return found != errorTexts().end() ? found->second : std::string();
 }
 
 bool SyntaxAnalyzer::parse(wchar_t const* text, Fields* fieldSource, Fields* variableSource,
@@ -160,6 +197,7 @@ bool SyntaxAnalyzer::parse(wchar_t const* text, Fields* fieldSource, Fields* var
     nesting = 0;
     if (lexer == nullptr) {
         error = true;
+        noteError("no lexer");
         return error;
     }
     lexer->setExpression(text);
@@ -185,6 +223,7 @@ bool SyntaxAnalyzer::parse(Fields* fieldSource, Fields* variableSource, ExpValue
     caseSensitive = caseFlag;
     if (tree == nullptr || tree->getRoot() == nullptr) {
         error = true;
+        noteError("no parsed expression to evaluate");
         return error;
     }
     ExpValue value = evaluateExp(tree->getRoot());

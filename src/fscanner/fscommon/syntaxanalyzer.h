@@ -23,6 +23,7 @@
 #define FSCANNER_FSCOMMON_SYNTAXANALYZER_H
 
 #include <cstdint>
+#include <string>
 #include <vector>
 
 #include "fscanner/fscommon/expvalue.h"
@@ -147,9 +148,18 @@ public:
     bool isSimple() const { return simple; }
     uint32_t getOrDepth() const { return orDepth; }
     bool getError() const { return error; }
+    // Why the last pass failed, for a person: the traced message without its
+    // "Class::function - " head and line end, e.g. "unexpected sequence!" or
+    // "expected operator.".  Empty when the last pass succeeded.
+    std::string getErrorText() const;
     Tree* getTree() const { return tree; }
 
 private:
+    // Keeps message (formatted as traced) as the text of the failure that
+    // just set `error`.  The analyzer's layout has no room for it: the text
+    // stands in a table of the process keyed by the analyzer, and the
+    // destructor removes it.
+    void noteError(std::string const& message);
     // Makes the hash candidate of `left == right` when there is none yet.
     void captureCandidate(ExpValue const& left, ExpValue const& right);
     // Runs a command of the table on evaluated arguments (tree walk).

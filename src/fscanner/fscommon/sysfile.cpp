@@ -1,10 +1,14 @@
 #include "fscanner/fscommon/sysfile.h"
 
 #include <fcntl.h>
+#include <linux/fiemap.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <climits>
 #include <cstdlib>
 #include <cstring>
@@ -26,7 +30,61 @@ bool narrowName(wchar_t const* wide, char (&out)[4096]) {
     return true;
 }
 
+// End, exclusive, of the bytes that are backed on disk for a file whose
+// content reaches contentEnd inside an allocation of allocated bytes: the
+// content rounded up to the reservation step, never past the allocation.
+uint64_t reservedEnd(uint64_t contentEnd, uint64_t allocated) {
+    const uint64_t step = LinuxMmFile::RESERVE_STEP;
+    uint64_t rounded = (contentEnd + step - 1) / step * step;
+    return rounded < allocated ? rounded : allocated;
+}
+
+// The system's reservation: 0 or the error number (posix_fallocate reports
+// it as its result and leaves errno alone).  Where the file system has no
+// fallocate, the C library emulates it by writing a zero into every block of
+// the range, which backs the blocks on ordinary file systems; copy-on-write
+// and compressing file systems can still refuse a later store, and nothing
+// short of writing each byte for real could promise more there.
+int systemReserve(int fd, uint64_t offset, uint64_t length) {
+    int rc;
+    do {
+        rc = posix_fallocate(fd, static_cast<off_t>(offset), static_cast<off_t>(length));
+    } while (rc == EINTR);
+    return rc;
+}
+
+// True when every byte of [from, to) lies in an extent the file system has
+// given the file already (written, unwritten or delayed).  Asked only after
+// a refusal: some file systems (XFS) charge a reservation in full even where
+// the blocks are there, so a full disk would refuse a write the space of
+// which reserve() took a moment before.  False where the question cannot be
+// asked (tmpfs has no extent map, and charges only for new pages anyway).
+bool rangeIsAllocated(int fd, uint64_t from, uint64_t to) {
+    const unsigned int kExtents = 16;
+    alignas(struct fiemap) unsigned char raw[sizeof(struct fiemap) + kExtents * sizeof(struct fiemap_extent)];
+    uint64_t covered = from;
+    while (covered < to) {
+        std::memset(raw, 0, sizeof raw);
+        struct fiemap* map = reinterpret_cast<struct fiemap*>(raw);
+        map->fm_start = covered;
+        map->fm_length = to - covered;
+        map->fm_extent_count = kExtents;
+        if (ioctl(fd, FS_IOC_FIEMAP, map) != 0 || map->fm_mapped_extents == 0) return false;
+        uint64_t before = covered;
+        for (unsigned int i = 0; i < map->fm_mapped_extents && covered < to; ++i) {
+            const struct fiemap_extent& extent = map->fm_extents[i];
+            if (extent.fe_logical > covered) return false;  // a hole before this extent
+            uint64_t end = extent.fe_logical + extent.fe_length;
+            if (end > covered) covered = end;
+        }
+        if (covered == before) return false;
+    }
+    return true;
+}
+
 }  // namespace
+
+int (*LinuxMmFile::reserveHook)(char const* name, int fd, uint64_t offset, uint64_t length) = nullptr;
 
 // ---- StdFile ------------------------------------------------------------------
 
@@ -59,9 +117,12 @@ bool StdFile::open() { return openMode("r+b"); }
 
 bool StdFile::close() {
     if (stream == nullptr) return false;
-    fclose(stream);
+    // fclose writes what is still buffered: a full disk shows here, and the
+    // file is then shorter than what write() accepted.  The stream is gone
+    // either way.
+    bool flushed = fclose(stream) == 0;
     stream = nullptr;
-    return true;
+    return flushed;
 }
 
 unsigned int StdFile::read(void* buffer, unsigned int length) {
@@ -145,6 +206,20 @@ bool LinuxMmFile::open() {
     position = 0;
     eofFlag = 0;
     if (onDisk == 0) return true;
+    // Fewer blocks than bytes: holes (the padding a crash leaves, or a file
+    // written without reservation), which a store through the mapping would
+    // have to fill.  They are backed now or the file is not opened.
+    struct stat st;
+    if (fstat(fd, &st) == 0 && static_cast<unsigned long long>(st.st_blocks) * 512 < onDisk &&
+        !reserveRange(0, onDisk)) {
+        int error = errno;
+        ::close(fd);
+        fd = -1;
+        logical = 0;
+        allocated = 0;
+        errno = error;
+        return false;
+    }
     return mapFile();
 }
 
@@ -212,26 +287,64 @@ unsigned int LinuxMmFile::write(void* buffer, unsigned int length) {
 //  - after growing it becomes OLD logical size + length, even when the write
 //    began before the end, so a straddling write leaves zeros behind its last
 //    byte that count as content.
+// Either way the disk space of the new content is reserved before the
+// logical size moves, and a refusal leaves every size as it was.
 bool LinuxMmFile::addChunk(unsigned int length) {
     if (static_cast<unsigned long long>(length) + logical <= allocated) {
-        logical = position + length;
+        uint32_t newLogical = position + length;
+        if (!reserveRange(reservedEnd(logical, allocated), reservedEnd(newLogical, allocated))) return false;
+        logical = newLogical;
         return true;
     }
-    if (!unMapFile() && allocated != 0) return false;
+    if (!grow(length, static_cast<uint64_t>(logical) + length)) return false;
+    logical += length;
+    return true;
+}
+
+bool LinuxMmFile::reserve(unsigned int length) {
+    if (fd == -1) {
+        errno = EBADF;
+        return false;
+    }
+    uint64_t end = static_cast<uint64_t>(logical) + length;
+    if (end <= allocated) return reserveRange(reservedEnd(logical, allocated), reservedEnd(end, allocated));
+    return grow(length, end);
+}
+
+bool LinuxMmFile::reserveRange(uint64_t from, uint64_t to) {
+    if (to <= from) return true;
+    int rc = reserveHook != nullptr ? reserveHook(name, fd, from, to - from) : systemReserve(fd, from, to - from);
+    if ((rc == ENOSPC || rc == EDQUOT) && rangeIsAllocated(fd, from, to)) rc = 0;
+    if (rc == 0) return true;
+    errno = rc;
+    return false;
+}
+
+bool LinuxMmFile::grow(unsigned int length, uint64_t contentEnd) {
+    // An allocation with nothing mapped is a file whose mapping failed: it
+    // cannot be grown under it.
+    if (address == kUnmapped && allocated != 0) return false;
     unsigned long long grown =
         static_cast<unsigned long long>(allocated) + CHUNK + (length & 0xFF000000u);
     // Past what a 32-bit size can describe, or, where `long` is 32 bits,
     // past what tell() and seek() can: the write fails instead of wrapping.
     const unsigned long long limit =
         sizeof(long) < 8 ? static_cast<unsigned long long>(LONG_MAX) : 0xFFFFFFFFull;
-    if (grown > limit) return false;
+    if (grown > limit) {
+        errno = EFBIG;
+        return false;
+    }
     uint32_t newAllocated = static_cast<uint32_t>(grown);
+    // Space first, then the sparse extension to the new allocation (its one
+    // written byte takes a block too), and only then the remapping: a full
+    // disk refuses one of the first two and the old mapping stays in use.
+    if (!reserveRange(reservedEnd(logical, allocated), reservedEnd(contentEnd, newAllocated))) return false;
     if (lseek(fd, static_cast<off_t>(newAllocated) - 1, SEEK_SET) == static_cast<off_t>(-1)) return false;
     char zero = 0;
     if (::write(fd, &zero, 1) != 1) return false;
+    unMapFile();
     fsync(fd);
     if (!mapFile()) return false;
-    logical += length;
     allocated = newAllocated;
     return true;
 }

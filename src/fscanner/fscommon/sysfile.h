@@ -6,7 +6,9 @@
 // for them.  No operation traces, keeps an error code or passes errno on: the
 // bool or the byte count is the whole report.  One object serves one thread
 // at a time; exclusion between processes is the business of the locks held by
-// the owner of the file.
+// the owner of the file.  One exception to the errno rule: a LinuxMmFile
+// operation refused because the disk cannot hold the file leaves errno at the
+// system's reason (ENOSPC, EDQUOT, EFBIG, ...), for the caller to report.
 #ifndef FSCANNER_FSCOMMON_SYSFILE_H
 #define FSCANNER_FSCOMMON_SYSFILE_H
 
@@ -83,9 +85,23 @@ private:
 // allocated size, zeros behind the last written byte; opening it again makes
 // the padding content.  The mapping is shared, so written bytes reach the file
 // without close().
+//
+// A store through a mapping into a part of the file that the disk cannot
+// back kills the process with SIGBUS, so no byte is ever copied into the
+// mapping before its disk space is reserved: the allocated size is a sparse
+// extension, and the space is reserved in RESERVE_STEP steps just ahead of
+// the logical size (every byte below the logical size rounded up to the step,
+// but not past the allocated size, is backed; open() backs the holes of a
+// file that has any).  A full disk thus refuses the write (0 bytes, errno
+// set) and leaves the file as it was, still mapped.
 class LinuxMmFile : public AbstractMmFile {
 public:
     static const uint32_t CHUNK = 0x1000000;
+    // Granule of the disk space reservation: a page, the unit in which a
+    // store through the mapping dirties the file anyway.  Reserving further
+    // ahead would make a cache that fits fail on a small file system; one
+    // reservation call still serves many record writes.
+    static const uint32_t RESERVE_STEP = 0x1000;
 
     // Copies name (kelm_malloc); null leaves the object nameless.
     explicit LinuxMmFile(char const* name);
@@ -95,7 +111,9 @@ public:
     // Unlinks the name, opens it anew (0660); nothing mapped or allocated yet.
     bool create() override;
     // Opens an existing file and maps it; an empty file stays unmapped.  A
-    // descriptor opened here stays open when sizing or mapping fails.
+    // descriptor opened here stays open when mapping fails.  A file with
+    // holes (left by a crash, or by a writer that did not reserve) has them
+    // backed first; when the disk cannot, the open fails, closed again.
     bool open() override;
     // Unmaps, truncates to the logical size, closes.  On a failed close the
     // object keeps its state and returns false.
@@ -104,7 +122,8 @@ public:
     // copies what remains and sets the flag; a full read clears it.
     unsigned int read(void* buffer, unsigned int length) override;
     // Grows the file (addChunk) when the write passes the logical size;
-    // returns length, or 0 when growth or mapping is missing.  No short write.
+    // returns length, or 0 when growth, the disk space or the mapping is
+    // missing.  No short write: a refused write changes nothing.
     unsigned int write(void* buffer, unsigned int length) override;
     // Clears the end flag always; never moves past the logical size.
     bool seek(long offset, int origin) override;
@@ -114,7 +133,16 @@ public:
     bool size(unsigned int* result) override;
 
     // Growth step; see the .cpp for the two ways the logical size moves.
+    // False, with the file as it was (and still mapped), when the disk space
+    // cannot be reserved or the file would pass what a 32-bit size holds.
     bool addChunk(unsigned int length);
+    // Makes room for length more bytes behind the content: grows the file as
+    // a write of length bytes at the end would and reserves the disk space,
+    // leaving the content, the position and the end flag alone.  After true,
+    // such a write cannot fail for want of space, which lets a caller that
+    // writes one logical record in several files check them all before it
+    // writes any.  False, errno set and the file as it was, otherwise.
+    bool reserve(unsigned int length);
     // (Re)maps the file: the allocated size when that is larger than the size
     // on disk, else the size on disk.
     bool mapFile();
@@ -126,9 +154,23 @@ public:
     uint32_t allocatedSize() const { return allocated; }
     bool isOpen() const { return fd != -1; }
 
+    // Test seam: when set, called instead of the system's reservation
+    // (posix_fallocate) with the file's name, its descriptor and the byte
+    // range to back; returns 0 or an error number such as ENOSPC.  Lets a
+    // test fill the disk for some files without a file system to fill.
+    static int (*reserveHook)(char const* name, int fd, uint64_t offset, uint64_t length);
+
 private:
     LinuxMmFile(const LinuxMmFile&) = delete;
     LinuxMmFile& operator=(const LinuxMmFile&) = delete;
+
+    // Backs the bytes [from, to) with disk space; true for an empty range.
+    // False with errno set to the reason.
+    bool reserveRange(uint64_t from, uint64_t to);
+    // Grows the allocation for a write of length bytes at the end of the
+    // content whose bytes reach contentEnd, reserving up to there; the
+    // logical size is the caller's to move.
+    bool grow(unsigned int length, uint64_t contentEnd);
 
     int32_t fd;
     uint32_t logical;

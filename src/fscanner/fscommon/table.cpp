@@ -2,6 +2,7 @@
 
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstring>
 #include <cwchar>
 #include <string>
@@ -96,6 +97,14 @@ unsigned long long integerValue(Field* field) {
 }
 
 size_t wideLength(wchar_t const* text) { return text == nullptr ? 0 : wcslen(text); }
+
+// Room for length more bytes at the end of file.  The table files are
+// LinuxMmFile objects, which can promise that; any other file answers by its
+// write alone.
+bool reserveTail(AbstractFile* file, unsigned int length) {
+    LinuxMmFile* mapped = dynamic_cast<LinuxMmFile*>(file);
+    return mapped == nullptr || mapped->reserve(length);
+}
 
 }  // namespace
 
@@ -221,6 +230,11 @@ bool Index::read(unsigned int slot, unsigned int* id, unsigned int* next) {
     *id = a;
     *next = b;
     return true;
+}
+
+bool Index::reserveSlot() {
+    if (file == nullptr) return false;
+    return reserveTail(file, 8);
 }
 
 bool Index::write(unsigned int bucket, unsigned int id) {
@@ -377,7 +391,9 @@ bool FS_Table::create() {
         putWideName(&header, schema.at(i)->getName());
     }
     if (!writeAll(dataFile, header)) {
+        int reason = errno;  // a full disk, for the caller to report
         close();
+        errno = reason;
         return false;
     }
     bitmapSize = bitmapBytes(schema.count());
@@ -468,6 +484,12 @@ bool FS_Table::erase() {
 
 bool FS_Table::writeValue(Field* field) {
     std::string bytes;
+    encodeValue(field, &bytes);
+    return writeAll(dataFile, bytes);
+}
+
+void FS_Table::encodeValue(Field* field, std::string* out) {
+    std::string& bytes = *out;
     switch (field->getType()) {
         case FIELD_INT8:
             bytes.push_back(static_cast<char>(static_cast<Int8Field*>(field)->value()));
@@ -500,31 +522,42 @@ bool FS_Table::writeValue(Field* field) {
             break;
         }
         default:
-            return true;  // type 6 is never stored
+            break;  // type 6 is never stored
     }
-    return writeAll(dataFile, bytes);
+}
+
+bool FS_Table::reserveInsert(unsigned int recordBytes) {
+    if (!reserveTail(pointerFile, kSlotSize)) return noteWriteFailure(pointerPath);
+    if (!reserveTail(dataFile, recordBytes)) return noteWriteFailure(dataPath);
+    for (Index* index : indexes) {
+        if (!index->reserveSlot()) return noteWriteFailure(index->getIndexFullPathName());
+    }
+    return true;
 }
 
 bool FS_Table::insert(Fields& record) {
     if (dataFile == nullptr || pointerFile == nullptr) return false;
     if (record.count() > kMaxFields) return false;  // the bitmap buffer holds 256 bits
+    if (writeFailed()) return false;
     if (!dataFile->seek(0, SEEK_FROM_END) || !pointerFile->seek(0, SEEK_FROM_END)) return false;
     uint32_t offset = static_cast<uint32_t>(dataFile->tell());
     unsigned int id = static_cast<unsigned int>(pointerFile->tell() / kSlotSize);
     std::string slot;
     codec::putFixed32(&slot, offset);
-    // The slot goes first: a crash between the two writes leaves a slot on a
-    // partial record, never a record without a slot.
-    if (!writeAll(pointerFile, slot)) return false;
     unsigned char bitmap[kBitmapBufferSize];
     std::memset(bitmap, 0, sizeof bitmap);
     for (unsigned int i = 0; i < record.count(); ++i)
         if (record.at(i)->isNull()) setBit(i, bitmap);
-    std::string bits(reinterpret_cast<char*>(bitmap), bitmapSize <= kBitmapBufferSize ? bitmapSize : 0);
-    if (!writeAll(dataFile, bits)) return false;
-    for (unsigned int i = 0; i < record.count(); ++i) {
-        if (!writeValue(record.at(i))) return false;
-    }
+    // The record goes out in one write, after the space of every part of
+    // the insert is sure: a full disk must not leave a slot on half a
+    // record, or an index without the number, in a table that lives on.
+    std::string bytes(reinterpret_cast<char*>(bitmap), bitmapSize <= kBitmapBufferSize ? bitmapSize : 0);
+    for (unsigned int i = 0; i < record.count(); ++i) encodeValue(record.at(i), &bytes);
+    if (!reserveInsert(static_cast<unsigned int>(bytes.size()))) return false;
+    // The slot goes first: a crash between the two writes leaves a slot on a
+    // partial record, never a record without a slot.
+    if (!writeAll(pointerFile, slot)) return noteWriteFailure(pointerPath);
+    if (!writeAll(dataFile, bytes)) return noteWriteFailure(dataPath);
     bool counted = incCount(0);
     bool indexed = hashIndexesUpdate(record, id);
     if (guard != nullptr) guardInsert(record, id);
@@ -651,9 +684,12 @@ bool FS_Table::readRecord(unsigned int id, Fields& record) {
 
 bool FS_Table::update(unsigned int id, Fields& record) {
     if (dataFile == nullptr || pointerFile == nullptr) return false;
+    if (writeFailed()) return false;
     if (compressed) {
+        // The new record first: when the disk refuses it, the old one is
+        // still there.  The files end as they would the other way round.
+        if (!insert(record)) return false;
         remove(id);
-        insert(record);
         return true;
     }
     Fields stored(record);
@@ -665,12 +701,12 @@ bool FS_Table::update(unsigned int id, Fields& record) {
     std::memset(bitmap, 0, sizeof bitmap);
     for (unsigned int i = 0; i < record.count(); ++i)
         if (record.at(i)->isNull()) setBit(i, bitmap);
-    if (!writeAll(dataFile, std::string(reinterpret_cast<char*>(bitmap), bitmapSize))) return false;
+    if (!writeAll(dataFile, std::string(reinterpret_cast<char*>(bitmap), bitmapSize))) return noteWriteFailure(dataPath);
     for (unsigned int i = 0; i < record.count(); ++i) {
         Field* field = record.at(i);
         unsigned int type = field->getType();
         if (type >= FIELD_INT8 && type <= FIELD_INT64) {
-            if (!writeValue(field)) return false;
+            if (!writeValue(field)) return noteWriteFailure(dataPath);
         } else if (type == FIELD_TEXT) {
             wchar_t const* now = static_cast<TextField*>(field)->value();
             wchar_t const* before = (i < stored.count() && stored.at(i)->getType() == FIELD_TEXT)
@@ -680,12 +716,11 @@ bool FS_Table::update(unsigned int id, Fields& record) {
                 // Fields before this one were overwritten already; harmless,
                 // the old record is dead from here on.
                 remove(id);
-                insert(record);
-                return true;
+                return insert(record);
             }
             // Same character count: overwritten in place even when the UTF-8
             // length differs.
-            if (!writeValue(field)) return false;
+            if (!writeValue(field)) return noteWriteFailure(dataPath);
         }
     }
     return true;
@@ -819,6 +854,10 @@ int FS_Table::unlock() { return mutex == nullptr ? 0 : mutex->release(); }
 // ---- FS_Table: index list -----------------------------------------------------
 
 bool FS_Table::hashIndexesUpdate(Fields& record, unsigned int id) {
+    // An index that could not take the number (a full disk) no longer holds
+    // every record: that is a failed write, and lookups through it would miss
+    // the record.  The other indexes are still written.
+    bool written = true;
     for (Index* index : indexes) {
         if (index->getFieldName() == nullptr) return false;
         Field* field = record.name(index->getFieldName());
@@ -829,7 +868,8 @@ bool FS_Table::hashIndexesUpdate(Fields& record, unsigned int id) {
             wchar_t key[24];
             // 64-bit values are keyed by their low 32 bits.
             wcs_itoa(static_cast<unsigned int>(integerValue(field)), key);
-            index->write(static_cast<unsigned int>(hash(key, Index::BUCKETS)), id);
+            if (!index->write(static_cast<unsigned int>(hash(key, Index::BUCKETS)), id))
+                written = noteWriteFailure(index->getIndexFullPathName());
         } else if (type == FIELD_TEXT) {
             wchar_t const* text = static_cast<TextField*>(field)->value();
             size_t n = wideLength(text);
@@ -842,11 +882,12 @@ bool FS_Table::hashIndexesUpdate(Fields& record, unsigned int id) {
             if (text != nullptr) std::memcpy(upper, text, (n + 1) * sizeof(wchar_t));
             else upper[0] = 0;
             wcsupper(upper);
-            index->write(static_cast<unsigned int>(hash(upper, Index::BUCKETS)), id);
+            if (!index->write(static_cast<unsigned int>(hash(upper, Index::BUCKETS)), id))
+                written = noteWriteFailure(index->getIndexFullPathName());
             if (upper != local) kelm_free(upper);
         }
     }
-    return true;
+    return written;
 }
 
 bool FS_Table::saveHashIndexList(std::vector<Index*>& list) {

@@ -10,6 +10,7 @@
 #define FSCANNER_FSCOMMON_TABLE_H
 
 #include <cstdint>
+#include <string>
 #include <vector>
 
 #include "fscanner/fscommon/fields.h"
@@ -70,6 +71,10 @@ public:
     bool read(unsigned int slot, unsigned int* id, unsigned int* next);
     // Puts id at the head of bucket's chain.
     bool write(unsigned int bucket, unsigned int id);
+    // Makes room on disk for the one overflow slot a write may append, so
+    // that the next write cannot fail for want of space.  False when the
+    // index is closed or the disk cannot hold the slot (errno says why).
+    bool reserveSlot();
     // Number of whole slots in the file; false when it is closed or its size
     // is not a whole number of slots (table_verify.cpp).
     bool slotCount(unsigned int* count);
@@ -111,7 +116,10 @@ public:
     bool erase();
 
     // Appends record (its own fields decide what is written) and takes the
-    // next number; true when the count and the indexes were updated.
+    // next number; true when the count and the indexes were updated.  The
+    // disk space of the slot, the record and an overflow slot in every index
+    // is made sure of before anything is written, so an insert refused by a
+    // full disk leaves the table exactly as it was.
     bool insert(Fields& record);
     // Reads record id into record's fields.  TRUE, record untouched, when the
     // table is closed.  After a read every field reports not null.  False at
@@ -119,7 +127,10 @@ public:
     bool read(unsigned int id, Fields& record);
     // Plain table: overwrites in place unless a text changes its character
     // count, in which case the record moves to a new number.  Compressed
-    // table: always moves.  The new number is not reported.
+    // table: always moves.  The new number is not reported.  A move whose
+    // insert fails answers false: in a compressed table the old record then
+    // stays as it was; in a plain one, whose leading fields were already
+    // overwritten, it is removed.
     bool update(unsigned int id, Fields& record);
     // Zeroes slot id; the data stays.
     bool remove(unsigned int id);
@@ -215,6 +226,18 @@ public:
     // check, false without damage on a closed table.
     bool verify();
     bool isDamaged() const;
+    // While the guard is armed the table also keeps its first failed write:
+    // an insert or an update that could not be stored (a full disk) fails
+    // every later insert and update until clearWriteFailure() or close(), so
+    // that no row written after the gap can name a row that is missing.
+    // Removals still work: they need no new space.  Without the guard the
+    // false of the operation is the only report.
+    bool writeFailed() const;
+    // errno of the failed write (ENOSPC, EDQUOT, EFBIG, ...), 0 when unknown
+    // or none failed; and the file that refused it, null while none did.
+    int writeError() const;
+    wchar_t const* failedWriteFile() const;
+    void clearWriteFailure();
     // The file and the check of the first failure; null while none failed.
     wchar_t const* damagedFile() const;
     char const* damagedCheck() const;
@@ -237,6 +260,14 @@ private:
     void guardInsert(Fields& record, unsigned int id);
     // Keeps file and check as the damage unless one is kept; returns false.
     bool noteDamage(wchar_t const* file, char const* check);
+    // Keeps file and the current errno as the failed write unless one is
+    // kept (and only under the guard); returns false.
+    bool noteWriteFailure(wchar_t const* file);
+    // Room for one insert: slot, record bytes and an overflow slot in each
+    // index; false as soon as one file cannot take its part.
+    bool reserveInsert(unsigned int recordBytes);
+    // Appends field's encoding to bytes; type 6 adds nothing.
+    void encodeValue(Field* field, std::string* bytes);
     bool verifyIndex(Index& index, uint32_t slots);
     void dropGuard();
 

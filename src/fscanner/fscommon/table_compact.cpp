@@ -108,7 +108,16 @@ bool FS_Table::compact(int percent) {
     bool more = moveFirst(id);
     while (more) {
         read(id, buffer);
-        temp->insert(buffer);
+        if (!temp->insert(buffer)) {
+            // A full disk: the copy would lack records, so it is dropped
+            // whole (which gives the space back) and this table stays as it
+            // is.
+            close();
+            temp->close();
+            temp->erase();
+            delete temp;
+            return false;
+        }
         ++copied;
         if (compactCopyHook != nullptr) compactCopyHook(copied);
         more = moveNext(id);

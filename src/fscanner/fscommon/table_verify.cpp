@@ -16,6 +16,7 @@
 // A crash breaks some of these (padding, a count behind its slot): a table
 // left by a crash is never verified, since the cache refuses it by its
 // update flag before.
+#include <cerrno>
 #include <cstring>
 #include <cwchar>
 #include <vector>
@@ -118,6 +119,30 @@ bool FS_Table::isDamaged() const { return guard != nullptr && guard->damaged; }
 wchar_t const* FS_Table::damagedFile() const { return isDamaged() ? guard->file.c_str() : nullptr; }
 
 char const* FS_Table::damagedCheck() const { return isDamaged() ? guard->check : nullptr; }
+
+bool FS_Table::writeFailed() const { return guard != nullptr && guard->writeFailed; }
+
+int FS_Table::writeError() const { return writeFailed() ? guard->writeError : 0; }
+
+wchar_t const* FS_Table::failedWriteFile() const { return writeFailed() ? guard->writeFile.c_str() : nullptr; }
+
+void FS_Table::clearWriteFailure() {
+    if (guard == nullptr) return;
+    guard->writeFailed = false;
+    guard->writeError = 0;
+    guard->writeFile.clear();
+}
+
+bool FS_Table::noteWriteFailure(wchar_t const* file) {
+    int error = errno;
+    if (guard != nullptr && !guard->writeFailed) {
+        guard->writeFailed = true;
+        guard->writeError = error;
+        guard->writeFile = file != nullptr ? file : L"";
+    }
+    errno = error;
+    return false;
+}
 
 bool FS_Table::noteDamage(wchar_t const* file, char const* check) {
     if (guard == nullptr) guard = new TableGuard();

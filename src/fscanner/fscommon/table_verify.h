@@ -26,6 +26,11 @@ struct TableGuard {
     bool damaged = false;
     std::wstring file;
     char const* check = nullptr;
+    // The first write the disk refused (FS_Table::writeFailed), with the
+    // errno it left and the file.
+    bool writeFailed = false;
+    int writeError = 0;
+    std::wstring writeFile;
     std::vector<IndexBuckets> indexes;
 };
 
