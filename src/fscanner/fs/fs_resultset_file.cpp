@@ -198,7 +198,8 @@ int FsResultSetReader_OnFile::sort(unsigned int key, unsigned int order, bool fl
     trace->traceMID(__LINE__, __FILE__, __func__,
                     "FsResultSetReader_OnFile::sort - file name is %S\n", wideName);
     NaturalMergeSort* sorter =
-        new NaturalMergeSort(callbacks.compare, callbacks.read, callbacks.write, callbacks.peek, callbacks.free);
+        new NaturalMergeSort(callbacks.compare, callbacks.read, callbacks.write, callbacks.peek,
+                             callbacks.free);
     trace->traceMID(__LINE__, __FILE__, __func__,
                     "FsResultSetReader_OnFile::sort - naturalMergeSort object created!\n");
     if (!resultsort::sortInMemory(fileName, wideName, key, order, flag)) sorter->sort(wideName, order, flag);

@@ -630,7 +630,8 @@ public:
         } else {
             builder.clear();
             if (!builder.addPlain(head, headLength)) return false;
-            if (text.separator && !builder.add(static_cast<uint32_t>(PathHelper::PathSeparator))) return false;
+            uint32_t separator = static_cast<uint32_t>(PathHelper::PathSeparator);
+            if (text.separator && !builder.add(separator)) return false;
             if (!builder.addPlain(name, record.nameLength)) return false;
             store(builder.get(), text);
             *slot = push(text);
@@ -1104,8 +1105,8 @@ PassRecord* makePassRecord(unsigned int key, const std::string& raw) {
         size_t keyLength = 0;
         if (!missing) {
             keyLength = (byName ? 0 : plainCharacters(path, stored.pathLength)) +
-                        (byName || joined ? plainCharacters(name, stored.nameLength) : 0) + (separator ? 1 : 0) +
-                        1;
+                        (byName || joined ? plainCharacters(name, stored.nameLength) : 0) +
+                        (separator ? 1 : 0) + 1;
         }
         size_t length = stored.complete ? raw.size() : 0;
         PassRecord* record = allocatePassRecord(keyLength, length);
@@ -1141,7 +1142,9 @@ PassRecord* makePassRecord(unsigned int key, const std::string& raw) {
     PassRecord* record = allocatePassRecord(keyLength, length);
     if (record != nullptr) {
         if (text != nullptr) std::wmemcpy(const_cast<wchar_t*>(record->key), text, keyLength);
-        if (length != 0) std::memcpy(const_cast<unsigned char*>(record->bytes), reloaded.written.data(), length);
+        if (length != 0) {
+            std::memcpy(const_cast<unsigned char*>(record->bytes), reloaded.written.data(), length);
+        }
         record->size = stored.size;
         record->written = reloaded.kept;
     }

@@ -83,7 +83,8 @@ public:
         if (d == -1) return false;
         struct stat st;
         // Sizes are 32-bit words, as for every file of this interface.
-        if (::fstat(d, &st) != 0 || st.st_size < 0 || static_cast<unsigned long long>(st.st_size) > 0xFFFFFFFFull) {
+        if (::fstat(d, &st) != 0 || st.st_size < 0 ||
+            static_cast<unsigned long long>(st.st_size) > 0xFFFFFFFFull) {
             ::close(d);
             return false;
         }
@@ -602,7 +603,8 @@ void distributeFirst(const std::vector<NaturalMergeReplay::Record>& in, Sides<ty
                 sides.template append<Ops>(toA, &item, 1);
             }
             ++i;
-            if (i == n || Ops::endsRun(static_cast<Key>(x.keyInFile), static_cast<Key>(in[i].keyInFile))) break;
+            if (i == n) break;
+            if (Ops::endsRun(static_cast<Key>(x.keyInFile), static_cast<Key>(in[i].keyInFile))) break;
         }
         toA = !toA;
     }

@@ -125,7 +125,8 @@ private:
 // with the runs it merged, and the same bound on the number of passes.
 //
 // Memory: 20 bytes per record besides the caller's records (36 when a key
-// number needs more than 32 bits), all of it reserved before the first trace.  Callers keep to files they may hold in memory (see limitBytes) and
+// number needs more than 32 bits), all of it reserved before the first trace.
+// Callers keep to files they may hold in memory (see limitBytes) and
 // give larger ones to NaturalMergeSort::sort.
 class NaturalMergeReplay {
 public:
