@@ -28,70 +28,14 @@
 #include <gtest/gtest.h>
 
 #include "support/testsupport.h"
+#include "support/toolrun.h"
 
 namespace {
 
-const std::string kTool = std::string(FSCANNER_TEST_BINARY_DIR) + "/fsquery";
 const std::string kSource = FSCANNER_TEST_SOURCE_DIR;
 
-struct ToolRun {
-    int status = -1;  // exit code, or 128 + signal
-    std::string out;
-    std::string err;
-    std::vector<std::string> lines() const {
-        std::vector<std::string> result;
-        std::istringstream in(out);
-        std::string line;
-        while (std::getline(in, line)) result.push_back(line);
-        return result;
-    }
-    std::set<std::string> lineSet() const {
-        std::vector<std::string> l = lines();
-        return std::set<std::string>(l.begin(), l.end());
-    }
-};
-
-// env entries "NAME=value" are added to the child's environment; "NAME" alone
-// removes the variable.
-ToolRun runTool(const testsupport::TempDir& dir, const std::vector<std::string>& args,
-                const std::vector<std::string>& env = {}) {
-    static int serial = 0;
-    std::string outName = dir.file("conv-stdout." + std::to_string(serial));
-    std::string errName = dir.file("conv-stderr." + std::to_string(serial));
-    ++serial;
-    pid_t pid = fork();
-    if (pid == 0) {
-        int out = open(outName.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-        int err = open(errName.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-        int in = open("/dev/null", O_RDONLY);
-        dup2(in, 0);
-        dup2(out, 1);
-        dup2(err, 2);
-        setenv("HOME", dir.file("home").c_str(), 1);
-        setenv("XDG_CACHE_HOME", dir.file("xdg").c_str(), 1);
-        unsetenv("FSCANNER_TRACE_LEVEL");
-        unsetenv("FSCANNER_TRACE_FILE");
-        unsetenv("FSCANNER_CONFIG");
-        for (const std::string& e : env) {
-            size_t eq = e.find('=');
-            if (eq == std::string::npos) unsetenv(e.c_str());
-            else setenv(e.substr(0, eq).c_str(), e.substr(eq + 1).c_str(), 1);
-        }
-        std::vector<std::string> argv{kTool};
-        argv.insert(argv.end(), args.begin(), args.end());
-        testsupport::execBuildProgram(argv);
-        _exit(98);
-    }
-    ToolRun run;
-    int status = 0;
-    waitpid(pid, &status, 0);
-    run.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-    run.out = testsupport::readFile(outName);
-    run.err = testsupport::readFile(errName);
-    unlink(outName.c_str());
-    unlink(errName.c_str());
-    return run;
-}
+using testsupport::ToolRun;
+using testsupport::runTool;
 
 bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
 

@@ -23,59 +23,13 @@
 #include <gtest/gtest.h>
 
 #include "support/testsupport.h"
+#include "support/toolrun.h"
 
 namespace {
 
-const std::string kTool = std::string(FSCANNER_TEST_BINARY_DIR) + "/fsquery";
 
-struct ToolRun {
-    int status = -1;  // exit code, or 128 + signal
-    std::string out;
-    std::string err;
-    // The printed lines in order, for a comparison that ignores order.
-    std::vector<std::string> sortedLines() const {
-        std::vector<std::string> result;
-        std::istringstream in(out);
-        std::string line;
-        while (std::getline(in, line)) result.push_back(line);
-        std::sort(result.begin(), result.end());
-        return result;
-    }
-};
-
-ToolRun runTool(const testsupport::TempDir& dir, const std::vector<std::string>& args) {
-    static int serial = 0;
-    std::string outName = dir.file("modes-stdout." + std::to_string(serial));
-    std::string errName = dir.file("modes-stderr." + std::to_string(serial));
-    ++serial;
-    pid_t pid = fork();
-    if (pid == 0) {
-        int out = open(outName.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-        int err = open(errName.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-        int in = open("/dev/null", O_RDONLY);
-        dup2(in, 0);
-        dup2(out, 1);
-        dup2(err, 2);
-        setenv("HOME", dir.file("home").c_str(), 1);
-        setenv("XDG_CACHE_HOME", dir.file("xdg").c_str(), 1);
-        unsetenv("FSCANNER_TRACE_LEVEL");
-        unsetenv("FSCANNER_TRACE_FILE");
-        unsetenv("FSCANNER_CONFIG");
-        std::vector<std::string> argv{kTool};
-        argv.insert(argv.end(), args.begin(), args.end());
-        testsupport::execBuildProgram(argv);
-        _exit(98);
-    }
-    ToolRun run;
-    int status = 0;
-    waitpid(pid, &status, 0);
-    run.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-    run.out = testsupport::readFile(outName);
-    run.err = testsupport::readFile(errName);
-    unlink(outName.c_str());
-    unlink(errName.c_str());
-    return run;
-}
+using testsupport::ToolRun;
+using testsupport::runTool;
 
 bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
 
