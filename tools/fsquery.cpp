@@ -73,6 +73,7 @@
 #include "fscanner/fscommon/mountlist.h"
 #include "fscanner/fscommon/pathhelper.h"
 #include "fscanner/fscommon/sync.h"
+#include "fscanner/fscommon/syntaxanalyzer.h"
 #include "fscanner/fscommon/wildcard.h"
 
 namespace {
@@ -620,45 +621,34 @@ ExpressionCheck checkExpression(const std::wstring& expression) {
     ExpressionCheck result;
     Fields columns;
     columns.add(L"FILENAME", FIELD_TEXT);
-    columns.add(L"ATTR", 3);
-    columns.add(L"SIZE", 4);
-    columns.add(L"PATHID", 3);
+    columns.add(L"ATTR", FIELD_INT32);
+    columns.add(L"SIZE", FIELD_INT64);
+    columns.add(L"PATHID", FIELD_INT32);
     columns.add(L"MD5", FIELD_TEXT);
-    columns.add(L"CRC32", 3);
-    columns.add(L"Q32", 3);
+    columns.add(L"CRC32", FIELD_INT32);
+    columns.add(L"Q32", FIELD_INT32);
     // Values of 1, so that a division by a column does not fault here.
     for (unsigned int i = 0; i < columns.count(); ++i) {
         Field* f = columns.at(i);
-        if (f->getType() == 3) static_cast<Int32Field*>(f)->value(1u);
-        else if (f->getType() == 4) static_cast<Int64Field*>(f)->value(1ull);
+        if (f->getType() == FIELD_INT32) static_cast<Int32Field*>(f)->value(1u);
+        else if (f->getType() == FIELD_INT64) static_cast<Int64Field*>(f)->value(1ull);
         else if (f->getType() == FIELD_TEXT) static_cast<TextField*>(f)->value(L"x");
     }
     PathStub pathStub;
     TypeStub typeStub;
-    QvLogWrapper* log = getQvLogFs();
-    log->startCapture(QvLogWrapper::LEVEL_MAX);
-    {
-        CriteriaEvaluator evaluator(expression.c_str());
-        evaluator.setFields(&columns);
-        evaluator.addCmd(L"path", EXP_STRING, EXP_NUMERIC, EXP_STRING, &pathStub);
-        evaluator.addCmd(L"type", EXP_NUMERIC, EXP_STRING, EXP_STRING, &typeStub);
-        ExpValue* hash = evaluator.getHashInfo();
-        result.ok = evaluator.isValid() && !evaluator.hasFailed();
-        if (hash != nullptr && hash->hasName()) {
-            std::string column;
-            appendLocal(column, hash->getNValueString());
-            result.indexColumn = column;
-        }
+    CriteriaEvaluator evaluator(expression.c_str());
+    evaluator.setFields(&columns);
+    evaluator.addCmd(L"path", EXP_STRING, EXP_NUMERIC, EXP_STRING, &pathStub);
+    evaluator.addCmd(L"type", EXP_NUMERIC, EXP_STRING, EXP_STRING, &typeStub);
+    ExpValue* hash = evaluator.getHashInfo();
+    result.ok = evaluator.isValid() && !evaluator.hasFailed();
+    if (hash != nullptr && hash->hasName()) {
+        std::string column;
+        appendLocal(column, hash->getNValueString());
+        result.indexColumn = column;
     }
-    std::vector<QvLogWrapper::Message> messages = log->stopCapture();
-    for (const QvLogWrapper::Message& m : messages) {
-        if (m.text.find("SyntaxAnalyzer::") == 0 || m.text.find("SyntaxTree::") == 0) {
-            std::string text = m.text;
-            size_t dash = text.find(" - ");
-            if (dash != std::string::npos) text = text.substr(dash + 3);
-            while (!text.empty() && (text.back() == '\n' || text.back() == ' ')) text.pop_back();
-            result.reason = text;
-        }
+    if (!result.ok && evaluator.getAnalyzer() != nullptr) {
+        result.reason = evaluator.getAnalyzer()->getErrorText();
     }
     return result;
 }
