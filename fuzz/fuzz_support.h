@@ -1,84 +1,42 @@
-// Shared pieces of the fuzz targets: a private temporary directory per
-// process (never the work tree), file writing and byte-to-text helpers.
+// Shared pieces of the fuzz targets, on top of the test support: a private
+// temporary directory per process (never the work tree), file writing that
+// aborts on failure, and a reader of the fuzzer's bytes.
 //
-// Every target keeps its files under one directory made by mkdtemp at the
-// first call and removed at exit, and points the table lock files there too.
+// Every target keeps its files under one directory made at the first call
+// and removed at exit, and points the table lock files there too.
 #ifndef FSCANNER_FUZZ_FUZZ_SUPPORT_H
 #define FSCANNER_FUZZ_FUZZ_SUPPORT_H
-
-#include <dirent.h>
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include <cstddef>
 #include <cstdint>
 #include <cstdlib>
-#include <cstring>
 #include <string>
 
 #include "fscanner/fscommon/sync.h"
+#include "support/testsupport.h"
 
 namespace fuzzsupport {
 
-inline void removeTree(std::string const& path) {
-    DIR* dir = opendir(path.c_str());
-    if (dir != nullptr) {
-        while (struct dirent* entry = readdir(dir)) {
-            if (std::strcmp(entry->d_name, ".") == 0 || std::strcmp(entry->d_name, "..") == 0) continue;
-            std::string child = path + "/" + entry->d_name;
-            struct stat st;
-            if (lstat(child.c_str(), &st) == 0 && S_ISDIR(st.st_mode))
-                removeTree(child);
-            else
-                unlink(child.c_str());
-        }
-        closedir(dir);
-    }
-    rmdir(path.c_str());
-}
-
-inline std::string& tempDirStorage() {
-    static std::string dir;
-    return dir;
-}
-
-inline void removeTempDirAtExit() {
-    if (!tempDirStorage().empty()) removeTree(tempDirStorage());
-}
-
-// The process's own directory, with no final "/".  Lock files of tables go
-// there as well.
+// The process's own directory, with no final "/", removed at exit with what
+// it holds.  Lock files of tables go there as well.
 inline std::string const& tempDir() {
-    std::string& dir = tempDirStorage();
-    if (dir.empty()) {
-        const char* base = std::getenv("TMPDIR");
-        std::string pattern = std::string(base != nullptr && *base != 0 ? base : "/tmp") + "/fscanner_fuzz_XXXXXX";
-        char* made = mkdtemp(&pattern[0]);
-        if (made == nullptr) std::abort();
-        dir = made;
-        LinuxSharedMutex::setStorePath((dir + "/").c_str());
-        std::atexit(removeTempDirAtExit);
+    static testsupport::TempDir* dir = nullptr;
+    static std::string path;
+    if (dir == nullptr) {
+        dir = new testsupport::TempDir();
+        path = dir->path();
+        LinuxSharedMutex::setStorePath((path + "/").c_str());
+        std::atexit([] { delete dir; });
     }
-    return dir;
+    return path;
 }
 
-inline std::wstring widen(std::string const& narrow) {
-    return std::wstring(narrow.begin(), narrow.end());
-}
+using testsupport::widen;
 
 // Writes bytes to path, replacing the file.  Aborts when it cannot: a fuzz
 // run on a full disk says nothing about the readers.
 inline void writeFile(std::string const& path, uint8_t const* data, size_t size) {
-    int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    if (fd < 0) std::abort();
-    size_t done = 0;
-    while (done < size) {
-        ssize_t n = write(fd, data + done, size - done);
-        if (n <= 0) std::abort();
-        done += static_cast<size_t>(n);
-    }
-    close(fd);
+    if (!testsupport::writeBytes(path, data, size)) std::abort();
 }
 
 inline void writeFile(std::string const& path, std::string const& bytes) {

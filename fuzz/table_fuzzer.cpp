@@ -7,6 +7,8 @@
 // file, pointer file and index list as 16-bit little-endian words, a 32-bit
 // chain slot, then the three files' bytes, then index patches of 12 bytes
 // (slot, record number, next slot) applied to a file of empty buckets.
+#include <unistd.h>
+
 #include <cstddef>
 #include <cstdint>
 #include <cstdio>

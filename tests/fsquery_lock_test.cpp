@@ -30,111 +30,19 @@
 #include <gtest/gtest.h>
 
 #include "support/testsupport.h"
+#include "support/toolrun.h"
 
 namespace {
 
-const std::string kTool = std::string(FSCANNER_TEST_BINARY_DIR) + "/fsquery";
 
 // Limits of the waits below: far above what any run needs, also under a
 // 32-bit emulator on a loaded machine; they only keep a broken tool from
 // hanging the suite.
 const std::chrono::seconds kPatience(240);
 
-struct ToolRun {
-    int status = -1;  // exit code, or 128 + signal
-    std::string out;
-    std::string err;
-    std::vector<std::string> lines() const {
-        std::vector<std::string> result;
-        std::istringstream in(out);
-        std::string line;
-        while (std::getline(in, line)) result.push_back(line);
-        return result;
-    }
-    std::set<std::string> lineSet() const {
-        std::vector<std::string> l = lines();
-        return std::set<std::string>(l.begin(), l.end());
-    }
-};
-
-// A run of the tool in a child process; standard output and error go to
-// files of the fixture.
-class Child {
-public:
-    Child(const testsupport::TempDir& dir, const std::vector<std::string>& args) {
-        static int serial = 0;
-        outName = dir.file("lockstdout." + std::to_string(serial));
-        errName = dir.file("lockstderr." + std::to_string(serial));
-        ++serial;
-        pid = fork();
-        if (pid == 0) {
-            int out = open(outName.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-            int err = open(errName.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-            int in = open("/dev/null", O_RDONLY);
-            dup2(in, 0);
-            dup2(out, 1);
-            dup2(err, 2);
-            setenv("HOME", dir.file("home").c_str(), 1);
-            setenv("XDG_CACHE_HOME", dir.file("xdg").c_str(), 1);
-            unsetenv("FSCANNER_TRACE_LEVEL");
-            unsetenv("FSCANNER_TRACE_FILE");
-            unsetenv("FSCANNER_CONFIG");
-            std::vector<std::string> argv{kTool};
-            argv.insert(argv.end(), args.begin(), args.end());
-            testsupport::execBuildProgram(argv);
-            _exit(98);
-        }
-    }
-    ~Child() {
-        if (pid > 0 && !done) {
-            kill(pid, SIGKILL);
-            waitpid(pid, nullptr, 0);
-        }
-    }
-    Child(const Child&) = delete;
-    Child& operator=(const Child&) = delete;
-
-    bool started() const { return pid > 0; }
-
-    // True once the child has ended; its run is then in result.
-    bool poll() {
-        if (done) return true;
-        int status = 0;
-        if (waitpid(pid, &status, WNOHANG) != pid) return false;
-        collect(status);
-        return true;
-    }
-    ToolRun wait() {
-        if (!done) {
-            int status = 0;
-            waitpid(pid, &status, 0);
-            collect(status);
-        }
-        return result;
-    }
-
-    ToolRun result;
-
-private:
-    void collect(int status) {
-        done = true;
-        result.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-        result.out = testsupport::readFile(outName);
-        result.err = testsupport::readFile(errName);
-        unlink(outName.c_str());
-        unlink(errName.c_str());
-    }
-
-    pid_t pid = -1;
-    bool done = false;
-    std::string outName;
-    std::string errName;
-};
-
-ToolRun runTool(const testsupport::TempDir& dir, const std::vector<std::string>& args) {
-    Child child(dir, args);
-    return child.wait();
-}
+using testsupport::ToolRun;
+using Child = testsupport::ToolChild;
+using testsupport::runTool;
 
 // What this process sees when it asks for the lock without waiting.
 enum class Probe { Missing, Held, Free };
@@ -233,14 +141,14 @@ TEST_F(FsQueryLock, RunsOnOneCacheTakeTurnsWhileOneBuildsSlowly) {
     while (std::chrono::steady_clock::now() < deadline) {
         if (!builderDone && builder.poll()) {
             builderDone = true;
-            built = builder.result;
+            built = builder.wait();
         }
         bool allDone = builderDone;
         for (Waiter& w : waiters) {
             if (w.finished) continue;
             allDone = false;
             if (!w.child->poll()) continue;
-            ToolRun r = w.child->result;
+            ToolRun r = w.child->wait();
             if (r.status == 7) {
                 EXPECT_EQ(timedOutMessage(300), r.err);
                 EXPECT_EQ("", r.out);

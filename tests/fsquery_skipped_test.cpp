@@ -21,33 +21,13 @@
 #include <gtest/gtest.h>
 
 #include "support/testsupport.h"
+#include "support/toolrun.h"
 
 namespace {
 
-const std::string kTool = std::string(FSCANNER_TEST_BINARY_DIR) + "/fsquery";
 const uid_t kNobody = 65534;
 
-struct ToolRun {
-    int status = -1;  // exit code, or 128 + signal; 100 when privileges could not be dropped
-    std::string out;
-    std::string err;
-    std::set<std::string> lineSet() const {
-        std::set<std::string> result;
-        std::istringstream in(out);
-        std::string line;
-        while (std::getline(in, line)) result.insert(line);
-        return result;
-    }
-    // The line of standard error that starts with prefix; empty if none.
-    std::string errLine(const std::string& prefix) const {
-        std::istringstream in(err);
-        std::string line;
-        while (std::getline(in, line)) {
-            if (line.compare(0, prefix.size(), prefix) == 0) return line;
-        }
-        return "";
-    }
-};
+using testsupport::ToolRun;
 
 bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
 
@@ -84,39 +64,10 @@ protected:
             testsupport::runCommand("chown -R " + std::to_string(kNobody) + ":" + std::to_string(kNobody) + " '" +
                                     root + "'");
         }
-        static int serial = 0;
-        std::string outName = root + "/stdout." + std::to_string(serial);
-        std::string errName = root + "/stderr." + std::to_string(serial);
-        ++serial;
-        pid_t pid = fork();
-        if (pid == 0) {
-            int out = open(outName.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-            int err = open(errName.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-            int in = open("/dev/null", O_RDONLY);
-            dup2(in, 0);
-            dup2(out, 1);
-            dup2(err, 2);
-            setenv("HOME", (root + "/home").c_str(), 1);
-            setenv("XDG_CACHE_HOME", (root + "/xdg").c_str(), 1);
-            setenv("LC_ALL", "C.UTF-8", 1);
-            unsetenv("FSCANNER_TRACE_LEVEL");
-            unsetenv("FSCANNER_TRACE_FILE");
-            unsetenv("FSCANNER_CONFIG");
-            if (drop && (setgid(kNobody) != 0 || setuid(kNobody) != 0)) _exit(100);
-            std::vector<std::string> argv{kTool};
-            argv.insert(argv.end(), all.begin(), all.end());
-            testsupport::execBuildProgram(argv);
-            _exit(98);
-        }
-        ToolRun result;
-        int status = 0;
-        waitpid(pid, &status, 0);
-        result.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-        result.out = testsupport::readFile(outName);
-        result.err = testsupport::readFile(errName);
-        unlink(outName.c_str());
-        unlink(errName.c_str());
-        return result;
+        testsupport::ToolOptions options;
+        options.env = {"LC_ALL=C.UTF-8"};
+        if (drop) options.runAs = kNobody;
+        return testsupport::runTool(dir, all, options);
     }
 
     void lockDirectory() {

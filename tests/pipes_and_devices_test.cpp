@@ -39,6 +39,7 @@
 #include "fscanner/fscommon/fsbuild.h"
 #include "support/cachefixture.h"
 #include "support/testsupport.h"
+#include "support/toolrun.h"
 
 using testsupport::TempDir;
 using testsupport::bytesOf;
@@ -50,8 +51,6 @@ namespace {
 // nothing blocks; generous for sanitizer builds and the 32-bit emulator.
 const unsigned int kChildSeconds = 20;
 const unsigned int kToolSeconds = 30;
-
-const std::string kTool = std::string(FSCANNER_TEST_BINARY_DIR) + "/fsquery";
 
 // Sums of the two-byte file "a\n" (shorter than 1024 bytes, so Q32 = CRC32).
 const std::string kMd5OfA = "60b725f10c9c85c70d97880dfe8191b3";
@@ -604,56 +603,16 @@ TEST(SpecialFileCache, CharacterDeviceIsStoredWithoutSumsAndPassedOverByTheFilte
 
 namespace {
 
-struct ToolRun {
-    int status = -1;  // exit code, or 128 + signal
-    std::string out;
-    std::string err;
-    std::set<std::string> lineSet() const {
-        std::set<std::string> result;
-        std::istringstream in(out);
-        std::string line;
-        while (std::getline(in, line)) result.insert(line);
-        return result;
-    }
-};
+using testsupport::ToolRun;
 
 // Runs the built tool on the fixture's own mount table and cache; an alarm
 // set before the exec ends a run that blocks (status 128 + SIGALRM).
-ToolRun runTool(const TempDir& dir, const std::vector<std::string>& args) {
-    static int serial = 0;
-    std::string outName = dir.file("stdout." + std::to_string(serial));
-    std::string errName = dir.file("stderr." + std::to_string(serial));
-    ++serial;
-    pid_t pid = fork();
-    if (pid == 0) {
-        int out = open(outName.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-        int err = open(errName.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-        int in = open("/dev/null", O_RDONLY);
-        dup2(in, 0);
-        dup2(out, 1);
-        dup2(err, 2);
-        setenv("HOME", dir.file("home").c_str(), 1);
-        setenv("XDG_CACHE_HOME", dir.file("xdg").c_str(), 1);
-        unsetenv("FSCANNER_TRACE_LEVEL");
-        unsetenv("FSCANNER_TRACE_FILE");
-        unsetenv("FSCANNER_CONFIG");
-        signal(SIGALRM, SIG_DFL);
-        alarm(kToolSeconds);  // kept across the exec
-        std::vector<std::string> argv{kTool, "--mount-table", dir.file("mtab"), "--cache",
-                                      dir.file("cache")};
-        argv.insert(argv.end(), args.begin(), args.end());
-        testsupport::execBuildProgram(argv);
-        _exit(98);
-    }
-    ToolRun run;
-    int status = 0;
-    waitpid(pid, &status, 0);
-    run.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-    run.out = testsupport::readFile(outName);
-    run.err = testsupport::readFile(errName);
-    unlink(outName.c_str());
-    unlink(errName.c_str());
-    return run;
+ToolRun runOnFixture(const TempDir& dir, const std::vector<std::string>& args) {
+    std::vector<std::string> all{"--mount-table", dir.file("mtab"), "--cache", dir.file("cache")};
+    all.insert(all.end(), args.begin(), args.end());
+    testsupport::ToolOptions options;
+    options.alarmSeconds = kToolSeconds;
+    return testsupport::runTool(dir, all, options);
 }
 
 }  // namespace
@@ -667,23 +626,23 @@ TEST(SpecialFileTool, Md5QueriesOverATreeWithAFifoCompleteInBothModes) {
 
     // Text output with sums lists only the files that have sums: the pipe,
     // which is never read, gets no line in either mode.
-    ToolRun direct = runTool(dir, {"--no-cache", "--md5", tree});
+    ToolRun direct = runOnFixture(dir, {"--no-cache", "--md5", tree});
     ASSERT_EQ(0, direct.status) << direct.err;
     EXPECT_EQ((std::set<std::string>{kMd5OfA + "  " + tree + "/regular"}), direct.lineSet());
 
-    ToolRun cached = runTool(dir, {"--md5", tree});
+    ToolRun cached = runOnFixture(dir, {"--md5", tree});
     ASSERT_EQ(0, cached.status) << cached.err;
     EXPECT_EQ((std::set<std::string>{kMd5OfA + "  " + tree + "/regular"}), cached.lineSet());
 
-    ToolRun named = runTool(dir, {"--no-cache", "--md5", "--timeout", "2000", "--name", "regular", tree});
+    ToolRun named = runOnFixture(dir, {"--no-cache", "--md5", "--timeout", "2000", "--name", "regular", tree});
     ASSERT_EQ(0, named.status) << named.err;
     EXPECT_EQ(std::set<std::string>{kMd5OfA + "  " + tree + "/regular"}, named.lineSet());
 
-    ToolRun crc = runTool(dir, {"--crc32", tree});
+    ToolRun crc = runOnFixture(dir, {"--crc32", tree});
     ASSERT_EQ(0, crc.status) << crc.err;
     EXPECT_EQ((std::set<std::string>{hex8(kCrcOfA) + "  " + tree + "/regular"}), crc.lineSet());
 
-    ToolRun known = runTool(dir, {"--known-md5", kMd5OfA, tree});
+    ToolRun known = runOnFixture(dir, {"--known-md5", kMd5OfA, tree});
     ASSERT_EQ(0, known.status) << known.err;
     EXPECT_EQ(std::set<std::string>{tree + "/regular"}, known.lineSet());
 }

@@ -18,8 +18,6 @@
 
 namespace testsupport {
 
-inline std::wstring widen(const std::string& s) { return std::wstring(s.begin(), s.end()); }
-
 // Bytes of a wide text whose characters are all below 256.
 inline std::string bytesOf(const wchar_t* w)
 {

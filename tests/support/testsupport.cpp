@@ -53,6 +53,13 @@ std::string readFile(const std::string& path) {
     return ss.str();
 }
 
+bool writeBytes(const std::string& path, const void* data, size_t size) {
+    std::FILE* out = std::fopen(path.c_str(), "wb");
+    if (out == nullptr) return false;
+    bool written = size == 0 || std::fwrite(data, 1, size, out) == size;
+    return std::fclose(out) == 0 && written;
+}
+
 bool fileExists(const std::string& path) {
     struct stat st;
     return lstat(path.c_str(), &st) == 0;

@@ -2,6 +2,7 @@
 #ifndef FSCANNER_TESTS_SUPPORT_TESTSUPPORT_H
 #define FSCANNER_TESTS_SUPPORT_TESTSUPPORT_H
 
+#include <cstddef>
 #include <string>
 #include <vector>
 
@@ -32,6 +33,10 @@ private:
 
 // Reads a whole file; empty when it cannot be read.
 std::string readFile(const std::string& path);
+// Writes size bytes to path, replacing the file; false when any step fails.
+bool writeBytes(const std::string& path, const void* data, size_t size);
+// Characters below 256 as they are: fixture names are ASCII or Latin-1 bytes.
+inline std::wstring widen(const std::string& s) { return std::wstring(s.begin(), s.end()); }
 bool fileExists(const std::string& path);
 // Removes a tree; permissions are restored first so unreadable fixtures go too.
 void removeTree(const std::string& path);
