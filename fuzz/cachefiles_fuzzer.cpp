@@ -18,6 +18,7 @@
 #include "fscanner/fs/fs_query.h"
 #include "fscanner/fscommon/cache2.h"
 #include "fuzz_support.h"
+#include "support/cachefixture.h"
 
 namespace {
 
@@ -29,10 +30,7 @@ struct Cache {
     Cache() : cache(nullptr) {
         dir = fuzzsupport::tempDir() + "/cache";
         mkdir(dir.c_str(), 0700);
-        glue.knownHashes = nullptr;
-        glue.checksumFlags = 0;
-        glue.reserved = 0;
-        glue.cacheRemoteDrives = false;
+        glue = testsupport::plainGlue();
         cache = new FS_Cache2(L"dirs", L"files", fuzzsupport::widen(dir).c_str(), true, false, &glue, L"fuzz");
     }
 };

@@ -44,10 +44,7 @@ struct CacheTest : ::testing::Test {
     FsGlue glue;
     CacheTest() : wdir(widen(dir.path())) {
         LinuxSharedMutex::setStorePath(locks.path().c_str());
-        glue.knownHashes = nullptr;
-        glue.checksumFlags = 0;
-        glue.reserved = 0;
-        glue.cacheRemoteDrives = false;
+        glue = testsupport::plainGlue();
     }
 };
 

@@ -48,10 +48,7 @@ struct DriverTest : ::testing::Test {
     std::string remote;
     DriverTest() {
         LinuxSharedMutex::setStorePath(locks.path().c_str());
-        glue.knownHashes = nullptr;
-        glue.checksumFlags = 0;
-        glue.reserved = 0;
-        glue.cacheRemoteDrives = false;
+        glue = testsupport::plainGlue();
         remote = tree.mkdirs("remote");
         tree.write("remote/a.txt", "aaaa");
         tree.write("remote/sub/b.txt", "bb");

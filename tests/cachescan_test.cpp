@@ -56,10 +56,8 @@ struct Fixture {
     explicit Fixture(unsigned int checksumFlags = 0) {
         LinuxSharedMutex::setStorePath(locks.path().c_str());
         KelCfg::setKey("common_trace_path", traces.path().c_str());
-        glue.knownHashes = nullptr;
+        glue = testsupport::plainGlue();
         glue.checksumFlags = checksumFlags;
-        glue.reserved = 0;
-        glue.cacheRemoteDrives = false;
         cache.reset(new Cache(L"dirs", L"files", widen(cacheDir.path()).c_str(), false, true, &glue,
                               L"prov"));
         EXPECT_EQ(0, cache->create(0, FS_CACHE_CREATE));

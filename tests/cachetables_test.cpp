@@ -48,10 +48,7 @@ struct TablesTest : ::testing::Test {
     FsGlue glue;
     TablesTest() {
         LinuxSharedMutex::setStorePath(locks.path().c_str());
-        glue.knownHashes = nullptr;
-        glue.checksumFlags = 0;
-        glue.reserved = 0;
-        glue.cacheRemoteDrives = false;
+        glue = testsupport::plainGlue();
     }
 };
 

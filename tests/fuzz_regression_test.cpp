@@ -384,10 +384,7 @@ TEST(DamagedResultFileTest, SortOfWholeRecordsIsUnchanged) {
 class DamagedCacheFilesTest : public ::testing::Test {
 protected:
     DamagedCacheFilesTest() {
-        glue.knownHashes = nullptr;
-        glue.checksumFlags = 0;
-        glue.reserved = 0;
-        glue.cacheRemoteDrives = false;
+        glue = testsupport::plainGlue();
     }
     testsupport::TempDir dir;
     FsGlue glue;

@@ -57,10 +57,7 @@ struct Fixture : ::testing::Test {
     std::wstring wdir;
     Fixture() : wdir(widen(dir.path())) {
         LinuxSharedMutex::setStorePath(locks.path().c_str());
-        glue.knownHashes = nullptr;
-        glue.checksumFlags = 0;
-        glue.reserved = 0;
-        glue.cacheRemoteDrives = false;
+        glue = testsupport::plainGlue();
     }
 };
 
