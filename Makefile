@@ -41,8 +41,11 @@ run: build
 BENCH_ENTRIES ?= 200000
 BENCH_SIZES   ?=
 BENCH_WORK    ?= $(BUILD)/bench-work
-bench: build
-	BUILD=$(BUILD) WORK=$(BENCH_WORK) BENCH_SIZES="$(BENCH_SIZES)" bench/fsquery_bench.sh $(BENCH_ENTRIES)
+# The build's messages go to standard error, so that standard output is the
+# report alone and can be saved as it is.
+bench: $(BUILD)/CMakeCache.txt
+	@$(CMAKE) --build $(BUILD) -j $(JOBS) --target fsquery gen_tree resultsort_bench >&2
+	@BUILD=$(BUILD) WORK=$(BENCH_WORK) BENCH_SIZES="$(BENCH_SIZES)" bench/fsquery_bench.sh $(BENCH_ENTRIES)
 
 asan:
 	$(CMAKE) -S . -B $(ASAN_BUILD) -DCMAKE_BUILD_TYPE=Debug -DFSCANNER_BUILD_BENCH=OFF \
