@@ -90,6 +90,8 @@ protected:
         generated = benchtree::generate(tree, kEntries, kSeed, summary);
         generateError = summary.error;
         needle = summary.needle;
+        generatedFiles = summary.files;
+        generatedDirectories = summary.directories;
         if (!generated) return;
         // Entries the generator never makes but the output has to get right:
         // a name that CSV must quote, a symbolic link (listed, never followed
@@ -166,6 +168,8 @@ protected:
     static std::string tree;
     static std::string mtab;
     static std::string needle;
+    static int64_t generatedFiles;
+    static int64_t generatedDirectories;
     static bool generated;
     static std::string generateError;
     static bool symlinked;
@@ -177,6 +181,8 @@ TempDir* OutputIdentity::dir = nullptr;
 std::string OutputIdentity::tree;
 std::string OutputIdentity::mtab;
 std::string OutputIdentity::needle;
+int64_t OutputIdentity::generatedFiles = 0;
+int64_t OutputIdentity::generatedDirectories = 0;
 bool OutputIdentity::generated = false;
 std::string OutputIdentity::generateError;
 bool OutputIdentity::symlinked = false;
@@ -188,6 +194,8 @@ const char kHeader[] = "path,name,fullPath,md5,sha256,attr,size,crc32,q32";
 TEST_F(OutputIdentity, GeneratorMakesTheRecordedTree) {
     // The generator itself is pinned first: a changed tree would make every
     // digest below fail for a reason that has nothing to do with the tool.
+    EXPECT_EQ(17263, generatedFiles);
+    EXPECT_EQ(2738, generatedDirectories);
     EXPECT_EQ(tree + "/tests3/share13/tmp27/vendor60/include207/assets774/needle.conf", needle);
 }
 
