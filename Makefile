@@ -32,11 +32,20 @@ run: build
 	@echo "== fsquery, second run: served from the cache"
 	$(BUILD)/fsquery --cache $(RUN_CACHE) --stats $(RUN_QUERY)
 
-# `make bench`: fsquery against find, fd and plocate on a generated tree
-# (BENCH_ENTRIES entries, default 200000; RUNS repetitions, default 5).
+# `make bench`: fsquery against find, plocate and fd on a generated tree of
+# BENCH_ENTRIES entries (default 200000): each job against its peer in
+# alternated rounds (RUNS, default 7), ratios against their goals, peak memory.
+# `BENCH_SIZES="50000 200000 800000" make bench`: the scaling table instead,
+# nanoseconds per entry and peak memory per size.  Trees are generated once
+# per size under $(BUILD)/bench-work (BENCH_WORK) and reused.
 BENCH_ENTRIES ?= 200000
-bench: build
-	BUILD=$(BUILD) bench/fsquery_bench.sh $(BENCH_ENTRIES)
+BENCH_SIZES   ?=
+BENCH_WORK    ?= $(BUILD)/bench-work
+# The build's messages go to standard error, so that standard output is the
+# report alone and can be saved as it is.
+bench: $(BUILD)/CMakeCache.txt
+	@$(CMAKE) --build $(BUILD) -j $(JOBS) --target fsquery gen_tree resultsort_bench >&2
+	@BUILD=$(BUILD) WORK=$(BENCH_WORK) BENCH_SIZES="$(BENCH_SIZES)" bench/fsquery_bench.sh $(BENCH_ENTRIES)
 
 asan:
 	$(CMAKE) -S . -B $(ASAN_BUILD) -DCMAKE_BUILD_TYPE=Debug -DFSCANNER_BUILD_BENCH=OFF \

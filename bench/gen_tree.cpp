@@ -2,13 +2,10 @@
 //
 //   gen_tree DIR [ENTRIES [SEED]]
 //       Makes a synthetic tree of about ENTRIES entries (files and directories,
-//       default 200000) under DIR, which must not exist yet.  Directories are
-//       filled breadth first with 4 to 40 files and 0 to 7 subdirectories
-//       each, so the depth grows with the size as in a real tree (8 levels
-//       for 200,000 entries).  Names mix common extensions; file sizes are
-//       0 to 64 KiB and set with ftruncate, so the tree takes little disk.
-//       Exactly one file is called "needle.conf", in one of the deepest
-//       directories, for exact-name queries.  The same SEED gives the same tree.
+//       default 200000) under DIR, which must not exist yet; the shape is
+//       described in tree_generator.h.  Exactly one file is called
+//       "needle.conf", for exact-name queries.  The same ENTRIES and SEED give
+//       the same tree, whatever the umask.
 //
 //   gen_tree --measure -- COMMAND [ARGS...]
 //       Runs COMMAND with standard output on /dev/null and prints one line:
@@ -31,93 +28,24 @@
 #include <string>
 #include <vector>
 
+#include "tree_generator.h"
+
 namespace {
-
-// A small deterministic generator (xorshift64*), so that trees are the same
-// on every machine.
-struct Random {
-    uint64_t state;
-    explicit Random(uint64_t seed) : state(seed * 0x9e3779b97f4a7c15ull + 1) {}
-    uint64_t next() {
-        state ^= state >> 12;
-        state ^= state << 25;
-        state ^= state >> 27;
-        return state * 0x2545f4914f6cdd1dull;
-    }
-    unsigned int below(unsigned int n) { return static_cast<unsigned int>(next() % n); }
-};
-
-const char* const kStems[] = {"main", "util", "config", "index", "test", "data", "image", "report",
-                              "module", "core", "helper", "readme", "notes", "build", "cache", "parser",
-                              "server", "client", "widget", "schema", "thumb", "backup", "Makefile", "log"};
-const char* const kExtensions[] = {".c", ".h", ".cpp", ".hpp", ".py", ".txt", ".md", ".json",
-                                   ".xml", ".png", ".jpg", ".so", ".o", ".log", ".gz", ".html",
-                                   ".js", ".conf", "", ".sh"};
-const char* const kDirectoryStems[] = {"src", "lib", "include", "doc", "share", "bin", "tests", "assets",
-                                       "pkg", "modules", "data", "tmp", "vendor", "res", "conf", "img"};
 
 int fail(const char* what, const std::string& path) {
     std::fprintf(stderr, "gen_tree: %s %s: %s\n", what, path.c_str(), std::strerror(errno));
     return 1;
 }
 
-int generate(const std::string& root, long entries, uint64_t seed) {
-    if (mkdir(root.c_str(), 0755) != 0) return fail("cannot create", root);
-    Random random(seed);
-    struct Level {
-        std::string path;
-        int depth;
-    };
-    std::deque<Level> pending;
-    pending.push_back({root, 0});
-    long made = 0;
-    long files = 0;
-    long directories = 0;
-    std::string deepest = root;
-    int deepestDepth = 0;
-    while (made < entries && !pending.empty()) {
-        Level level = pending.front();
-        pending.pop_front();
-        if (level.depth > deepestDepth || (level.depth == deepestDepth && random.below(4) == 0)) {
-            deepest = level.path;
-            deepestDepth = level.depth;
-        }
-        unsigned int fileCount = 4 + random.below(37);
-        for (unsigned int i = 0; i < fileCount && made < entries; ++i) {
-            char name[96];
-            const char* stem = kStems[random.below(sizeof kStems / sizeof kStems[0])];
-            const char* extension = kExtensions[random.below(sizeof kExtensions / sizeof kExtensions[0])];
-            std::snprintf(name, sizeof name, "%s_%ld%s", stem, files, extension);
-            std::string path = level.path + "/" + name;
-            int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL, 0644);
-            if (fd < 0) return fail("cannot create", path);
-            off_t size = random.below(4) == 0 ? 0 : static_cast<off_t>(random.below(65536));
-            if (size > 0 && ftruncate(fd, size) != 0) return fail("cannot size", path);
-            close(fd);
-            ++made;
-            ++files;
-        }
-        unsigned int subdirectories = random.below(8);
-        // Keep the walk going while the tree is young, however the dice fall.
-        if (pending.empty() && subdirectories == 0) subdirectories = 2;
-        for (unsigned int i = 0; i < subdirectories && made < entries; ++i) {
-            char name[64];
-            std::snprintf(name, sizeof name, "%s%ld",
-                          kDirectoryStems[random.below(sizeof kDirectoryStems / sizeof kDirectoryStems[0])],
-                          directories);
-            std::string path = level.path + "/" + name;
-            if (mkdir(path.c_str(), 0755) != 0) return fail("cannot create", path);
-            pending.push_back({path, level.depth + 1});
-            ++made;
-            ++directories;
-        }
+int generate(const std::string& root, long long entries, uint64_t seed) {
+    benchtree::TreeSummary summary;
+    if (!benchtree::generate(root, entries, seed, summary)) {
+        std::fprintf(stderr, "gen_tree: %s\n", summary.error.c_str());
+        return 1;
     }
-    std::string needle = deepest + "/needle.conf";
-    int fd = open(needle.c_str(), O_WRONLY | O_CREAT | O_EXCL, 0644);
-    if (fd < 0) return fail("cannot create", needle);
-    close(fd);
-    std::printf("gen_tree: %ld files, %ld directories, depth %d, needle at %s\n", files + 1, directories,
-                deepestDepth, needle.c_str());
+    std::printf("gen_tree: %lld files, %lld directories, depth %d, needle at %s\n",
+                static_cast<long long>(summary.files), static_cast<long long>(summary.directories),
+                summary.depth, summary.needle.c_str());
     return 0;
 }
 
@@ -155,7 +83,7 @@ int main(int argc, char** argv) {
         std::fprintf(stderr, "usage: gen_tree DIR [ENTRIES [SEED]]\n       gen_tree --measure -- COMMAND [ARGS...]\n");
         return 2;
     }
-    long entries = argc >= 3 ? std::strtol(argv[2], nullptr, 10) : 200000;
+    long long entries = argc >= 3 ? std::strtoll(argv[2], nullptr, 10) : 200000;
     uint64_t seed = argc >= 4 ? std::strtoull(argv[3], nullptr, 10) : 1;
     if (entries < 1) {
         std::fprintf(stderr, "gen_tree: ENTRIES must be a positive number\n");
