@@ -11,6 +11,7 @@
 
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
+#include "fscanner/fscommon/cache_files.h"
 #include "fscanner/fscommon/stringhelper.h"
 
 void (*FS_Table::compactCopyHook)(unsigned int copied) = nullptr;
@@ -23,16 +24,6 @@ void passStage(int stage) {
 }  // namespace
 
 namespace {
-
-wchar_t* withSuffix(wchar_t const* text, wchar_t const* suffix) {
-    if (text == nullptr) return nullptr;
-    size_t a = wcslen(text), b = wcslen(suffix);
-    wchar_t* out = static_cast<wchar_t*>(kelm_malloc((a + b + 1) * sizeof(wchar_t)));
-    if (out == nullptr) return nullptr;
-    std::memcpy(out, text, a * sizeof(wchar_t));
-    std::memcpy(out + a, suffix, (b + 1) * sizeof(wchar_t));
-    return out;
-}
 
 // The results of remove and rename are not looked at: what a failure leaves
 // is the state a crash at that point would leave.
@@ -70,7 +61,7 @@ bool FS_Table::compact(int percent) {
     log->traceMID(__LINE__, __FILE__, __FUNCTION__, "FS_Table::compact - performing [%ls] table compact...\n",
                   name);
 
-    wchar_t* tempName = withSuffix(name, L"_cpt");
+    wchar_t* tempName = cachefiles::compactionName(name);
     if (tempName == nullptr) {
         close();
         return false;
@@ -84,7 +75,7 @@ bool FS_Table::compact(int percent) {
     bool ok = temp->create();
     if (ok) {
         for (Index* index : indexes) {
-            wchar_t* tempIndex = withSuffix(index->getIndexName(), L"_cpt");
+            wchar_t* tempIndex = cachefiles::compactionName(index->getIndexName());
             if (tempIndex != nullptr) temp->addHashIndex(tempIndex, index->getFieldName());
             kelm_free(tempIndex);
         }
