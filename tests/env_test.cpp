@@ -16,6 +16,7 @@
 #include "base/KelCfg.h"
 #include "fscanner/fs/fs_loader.h"
 #include "fscanner/fs/fs_query.h"
+#include "fscanner/fs/fs_resultset_file.h"
 #include "fscanner/fscommon/cachebase.h"
 #include "fscanner/fscommon/cache2.h"
 #include "fscanner/fscommon/sysfile.h"
@@ -292,6 +293,28 @@ TEST_F(CacheUnderEnv, ProviderMarkWithTrailingBytesIsRewrittenToSixteen) {
     testsupport::HitWriter writer;
     ASSERT_EQ(0, query(writer));
     EXPECT_EQ(mark, testsupport::readFile(cache.file("pr_hash")));
+}
+
+TEST(InjectedFailure, TmpnamWithoutANameSendsTheResultSetToItsFallback) {
+    TempDir dir;
+    char buffer[4096];
+    std::string old = getcwd(buffer, sizeof buffer) != nullptr ? buffer : "/";
+    ASSERT_EQ(0, chdir(dir.path().c_str()));
+    FsResultSet_OnFile::resetTempNameSources();
+    ErrorEnv env;
+    env.failNth(EnvCall::TempName, 1, EEXIST);
+    std::string name;
+    {
+        ScopedEnv installed(&env);
+        testsupport::TraceCapture capture;
+        FsResultSet_OnFile set;
+        name = set.getFileName();
+        EXPECT_TRUE(capture.contains("The temp file name is: ./fsq_0")) << capture.dump();
+        EXPECT_TRUE(testsupport::fileExists(dir.file("fsq_0")));
+    }
+    EXPECT_EQ("./fsq_0", name);
+    EXPECT_EQ(1, env.calls(EnvCall::TempName));
+    ASSERT_EQ(0, chdir(old.c_str()));
 }
 
 // ---- the loader

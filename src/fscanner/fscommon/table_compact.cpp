@@ -15,13 +15,6 @@
 #include "fscanner/fscommon/stringhelper.h"
 
 void (*FS_Table::compactCopyHook)(unsigned int copied) = nullptr;
-void (*FS_Table::compactStageHook)(int stage) = nullptr;
-
-namespace {
-void passStage(int stage) {
-    if (FS_Table::compactStageHook != nullptr) FS_Table::compactStageHook(stage);
-}
-}  // namespace
 
 namespace {
 
@@ -92,7 +85,6 @@ bool FS_Table::compact(int percent) {
         return false;
     }
 
-    passStage(1);
     // Copy: numbers become dense in the new table; inserts fill its indexes.
     unsigned int copied = 0;
     unsigned int id = 0;
@@ -114,7 +106,6 @@ bool FS_Table::compact(int percent) {
         more = moveNext(id);
     }
 
-    passStage(2);
     // Swap the indexes in, position by position.
     std::vector<Index*>& fresh = temp->getIndexes();
     for (size_t i = 0; i < indexes.size() && i < fresh.size(); ++i) {
@@ -124,17 +115,14 @@ bool FS_Table::compact(int percent) {
         renameWide(fresh[i]->getIndexFullPathName(), indexes[i]->getIndexFullPathName());
     }
 
-    passStage(3);
     close();
     temp->close();
     temp->eraseHashIndexList(temp->getIndexes());
 
     removeWide(dataPath);
     removeWide(pointerPath);
-    passStage(4);
     renameWide(temp->getDataPath(), dataPath);
     renameWide(temp->getPointerPath(), pointerPath);
-    passStage(5);
 
     delete temp;
     return true;
