@@ -19,6 +19,7 @@
 #include "fscanner/fscommon/cache2.h"
 #include "fscanner/fscommon/table.h"
 #include "support/cachefixture.h"
+#include "support/error_env.h"
 
 using testsupport::HitWriter;
 using testsupport::widen;
@@ -112,12 +113,25 @@ void killOnScan(char const*)
         raise(SIGKILL);
 }
 
-int killAtStage = 0;
-void killOnStage(int stage)
-{
-    if (stage == killAtStage)
-        raise(SIGKILL);
-}
+// The stages of the first table's compaction (the directories table "dirs"),
+// each reached through the Env call that begins the step after it: 1 the
+// temporary table exists (its first record's space is reserved next), 2 the
+// copy is done (the first old index is removed next), 3 the indexes are
+// swapped in (the copy's data file is truncated as it closes), 4 the old data
+// and pointer files are removed (the copy's data file is renamed next), 5 the
+// new files are in place (the copy's lock file is removed next).
+struct CompactionStage {
+    testsupport::EnvCall call;
+    char const* path;
+};
+const CompactionStage kCompactionStages[] = {
+    {testsupport::EnvCall::Any, ""},
+    {testsupport::EnvCall::ReserveSpace, "dirs_cpt.pxx"},
+    {testsupport::EnvCall::RemoveFile, "dirs_PATHNAME.idx"},
+    {testsupport::EnvCall::TruncateFile, "dirs_cpt.dat"},
+    {testsupport::EnvCall::RenameFile, "dirs_cpt.dat"},
+    {testsupport::EnvCall::RemoveFile, "dirs_cpt_t_mutex"},
+};
 void killOnCopy(unsigned int copied)
 {
     if (copied == 3)
@@ -132,7 +146,6 @@ struct DrillTest : ::testing::Test {
     DrillTest() { root = trimmed(tree.path()); }
     ~DrillTest() override {
         FS_CacheBase::scanHook = nullptr;
-        FS_Table::compactStageHook = nullptr;
         FS_Table::compactCopyHook = nullptr;
     }
     // After a crash: the cache is refused or answers whole; after a rebuild
@@ -262,11 +275,13 @@ TEST_F(DrillTest, CompactionKilledAtEachStageLeavesACacheServedWholeOrRebuilt)
             if (c.create(0, FS_CACHE_OPEN) != 0)
                 _exit(3);
             c.close();
+            testsupport::ErrorEnv env;
+            testsupport::ScopedEnv installed(&env);
             if (stage == 0) {
                 FS_Table::compactCopyHook = killOnCopy;
             } else {
-                killAtStage = stage;
-                FS_Table::compactStageHook = killOnStage;
+                env.actAt(kCompactionStages[stage].call, kCompactionStages[stage].path, 1,
+                          [] { raise(SIGKILL); });
             }
             c.compact();
             _exit(5);  // the compaction ran past the kill point

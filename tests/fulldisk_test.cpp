@@ -8,8 +8,8 @@
 // out of space are taken back, every other tree of the cache stays and is
 // served, and the next query with room rebuilds what is missing.
 //
-// Most tests fill the "disk" through LinuxMmFile::reserveHook, which grants
-// the files whose name holds a pattern (a directory, or one file's name) a
+// Most tests fill the "disk" through a fault-injecting Env, which grants the
+// files whose name holds a pattern (a directory, or one file's name) a
 // budget of space and refuses the rest with ENOSPC; they need no privilege.  The last ones mount a small tmpfs and fill
 // it for real, through the library in a forked child (so that a SIGBUS fails
 // the test instead of ending the suite) and through the fsquery tool.  They
@@ -46,6 +46,7 @@
 #include "fscanner/fscommon/sysfile.h"
 #include "fscanner/fscommon/table.h"
 #include "support/cachefixture.h"
+#include "support/error_env.h"
 #include "support/testsupport.h"
 
 using testsupport::TempDir;
@@ -60,65 +61,31 @@ const uint32_t kChunk = LinuxMmFile::CHUNK;
 
 // ------------------------------------------------------------ the filling disk
 
-// A file system with a budget of free space, played through the file layer's
-// reservation seam for the files whose name contains a pattern.  Like ext4
-// and tmpfs it charges a file only for bytes it has not reserved before; in
-// "charges in full" mode it charges every request whole, as XFS does.  What
-// it grants it reserves for real.
+// A file system with a budget of free space, played by a fault-injecting Env
+// for the files whose name contains a pattern: the library's reservations
+// (posix_fallocate) of those files draw on the budget.  Like ext4 and tmpfs
+// it charges a file only for bytes it has not reserved before; in "charges
+// in full" mode it charges every request whole, as XFS does.  What it grants
+// it reserves for real.
 struct FillingDisk {
-    static std::string pattern;
-    static long long budget;  // bytes still free; negative: no limit
-    static bool chargesInFull;
-    static int refusals;
-    static std::map<std::pair<dev_t, ino_t>, uint64_t> reservedEnd;
+    static FillingDisk* current;
+    testsupport::ErrorEnv env;
+    testsupport::ScopedEnv installed;
 
-    static int reserve(char const* name, int fd, uint64_t offset, uint64_t length) {
-        if (name != nullptr && std::strstr(name, pattern.c_str()) != nullptr) {
-            uint64_t charge = length;
-            struct stat st;
-            std::pair<dev_t, ino_t> key(0, 0);
-            if (!chargesInFull && fstat(fd, &st) == 0) {
-                key = std::make_pair(st.st_dev, st.st_ino);
-                if (st.st_size == 0) reservedEnd.erase(key);  // a file made anew
-                uint64_t had = reservedEnd.count(key) != 0 ? reservedEnd[key] : 0;
-                uint64_t end = offset + length;
-                charge = end <= had ? 0 : end - (offset > had ? offset : had);
-            }
-            if (budget >= 0) {
-                if (static_cast<long long>(charge) > budget) {
-                    ++refusals;
-                    return ENOSPC;
-                }
-                budget -= static_cast<long long>(charge);
-            }
-            if (!chargesInFull && (reservedEnd.count(key) == 0 || reservedEnd[key] < offset + length))
-                reservedEnd[key] = offset + length;
-        }
-        return posix_fallocate(fd, static_cast<off_t>(offset), static_cast<off_t>(length));
+    explicit FillingDisk(const std::string& filesContaining) : env(), installed(&env) {
+        env.limitSpaceFor(filesContaining);
+        current = this;
     }
-
-    explicit FillingDisk(const std::string& filesContaining) {
-        pattern = filesContaining;
-        budget = -1;
-        chargesInFull = false;
-        refusals = 0;
-        reservedEnd.clear();
-        LinuxMmFile::reserveHook = &FillingDisk::reserve;
-    }
-    ~FillingDisk() {
-        LinuxMmFile::reserveHook = nullptr;
-        budget = -1;
-    }
+    ~FillingDisk() { current = nullptr; }
     // From now on only bytes more fit.
-    void fillAfter(long long bytes) { budget = bytes; }
-    void makeRoom() { budget = -1; }
+    void fillAfter(long long bytes) { env.fillAfter(bytes); }
+    void makeRoom() { env.makeRoom(); }
+    void chargeInFull() { env.chargeInFull(true); }
+    long long budget() const { return env.spaceLeft(); }
+    int refusals() const { return env.refusals(); }
 };
 
-std::string FillingDisk::pattern;
-long long FillingDisk::budget = -1;
-bool FillingDisk::chargesInFull = false;
-int FillingDisk::refusals = 0;
-std::map<std::pair<dev_t, ino_t>, uint64_t> FillingDisk::reservedEnd;
+FillingDisk* FillingDisk::current = nullptr;
 
 off_t sizeOnDisk(const std::string& path) {
     struct stat st;
@@ -150,7 +117,7 @@ TEST(FullDiskFile, RefusedWriteLeavesTheFileAsItWasAndStillMapped) {
     errno = 0;
     EXPECT_EQ(0u, f.write(&big[0], 8000));
     EXPECT_EQ(ENOSPC, errno);
-    EXPECT_EQ(1, FillingDisk::refusals);
+    EXPECT_EQ(1, disk.refusals());
     EXPECT_EQ(150u, f.logicalSize());
     EXPECT_EQ(kChunk, f.allocatedSize());
     EXPECT_EQ(150, f.tell());
@@ -241,7 +208,7 @@ TEST(FullDiskFile, ReserveMakesRoomThatTheWritesThenUse) {
     std::string piece(5000, 'p');
     EXPECT_EQ(5000u, f.write(&piece[0], 5000));
     EXPECT_EQ(5000u, f.write(&piece[0], 5000));
-    EXPECT_EQ(0, FillingDisk::refusals);
+    EXPECT_EQ(0, disk.refusals());
     errno = 0;
     EXPECT_FALSE(f.reserve(5000));
     EXPECT_EQ(ENOSPC, errno);
@@ -294,7 +261,7 @@ TEST(FullDiskFile, SpaceAlreadyReservedIsNotRefusedWhereTheDiskChargesAgain) {
         GTEST_SKIP() << "needs a file system with an extent map (ext4, XFS, btrfs) for the temporary directory";
     }
     FillingDisk disk(dir.path());
-    FillingDisk::chargesInFull = true;
+    disk.chargeInFull();
     std::string path = dir.file("again.bin");
     LinuxMmFile f(path.c_str());
     ASSERT_TRUE(f.create());
@@ -304,10 +271,10 @@ TEST(FullDiskFile, SpaceAlreadyReservedIsNotRefusedWhereTheDiskChargesAgain) {
     // write asks for the same pages again and must not be refused.
     disk.fillAfter(4096);
     ASSERT_TRUE(f.reserve(6000));
-    EXPECT_EQ(0, FillingDisk::budget);
+    EXPECT_EQ(0, disk.budget());
     std::string record(6000, 'r');
     EXPECT_EQ(6000u, f.write(&record[0], 6000));
-    EXPECT_GE(FillingDisk::refusals, 1);
+    EXPECT_GE(disk.refusals(), 1);
     // Pages that were never reserved are still refused.
     EXPECT_EQ(0u, f.write(&record[0], 6000));
     EXPECT_TRUE(f.close());
@@ -489,7 +456,7 @@ TEST_F(FullDiskTable, CompactionThatRunsOutOfSpaceLeavesTheTableAsItWas) {
     FillingDisk disk("_cpt");
     disk.fillAfter(2 * 524288 + 6 * 4096);
     EXPECT_FALSE(t->compact(30));
-    EXPECT_GE(FillingDisk::refusals, 1);
+    EXPECT_GE(disk.refusals(), 1);
     for (const char* left : {"names_cpt.dat", "names_cpt.pxx", "names_name_cpt.idx", "names_size_cpt.idx"})
         EXPECT_FALSE(testsupport::fileExists(dir.file(left))) << left;
 
@@ -568,7 +535,7 @@ TEST_F(FullDiskCache, BuildRefusedByAFullDiskIsACacheErrorAndTheNextQueryRebuild
     int reason = 0;
     EXPECT_EQ(CACHE_ERROR, runQuery(q, w, true, &reason));
     EXPECT_EQ(ENOSPC, reason);
-    EXPECT_GE(FillingDisk::refusals, 1);
+    EXPECT_GE(disk.refusals(), 1);
     EXPECT_TRUE(w.hits.empty()) << "nothing of a failed query is served";
     EXPECT_TRUE(cap.contains("(WRITE FAILED) cannot write the cache file '")) << cap.dump();
     EXPECT_TRUE(cap.contains("files.dat' while building '" + tree + "'")) << cap.dump();
@@ -665,7 +632,7 @@ std::string gFillBelow;
 
 void fillWhenScanReaches(char const* directory) {
     if (!gFillBelow.empty() && std::strncmp(directory, gFillBelow.c_str(), gFillBelow.size()) == 0)
-        FillingDisk::budget = 0;
+        FillingDisk::current->fillAfter(0);
 }
 
 TEST_F(FullDiskCache, RootBuiltBeforeTheRefusedOneInTheSameQueryIsKept) {

@@ -10,6 +10,7 @@
 
 #include "base/KelCfg.h"
 #include "base/QvLogWrapper.h"
+#include "fscanner/fscommon/env.h"
 
 const char* createProviderSymbol = "createProvider";
 
@@ -86,15 +87,16 @@ void* loadLibraryAndFactory(const char* name, const FsConfig* config, const char
     char fileName[kNameBufferSize];
     std::snprintf(fileName, sizeof(fileName), "%s%s%s", prefix.c_str(), name, ".so");
 
-    void* library = dlopen(fileName, RTLD_NOW);
+    fscanner::Env* env = fscanner::Env::Current();
+    void* library = env->loadLibrary(fileName, RTLD_NOW);
     if (library == nullptr) {
-        const char* reason = dlerror();
+        const char* reason = env->libraryError();
         log->traceMIN(__LINE__, __FILE__, __FUNCTION__, "*** Error: cannot load DLL '%s' (%s)\n", fileName,
                       reason != nullptr ? reason : "");
         return nullptr;
     }
     // A library without the symbol stays loaded; only the handle is withheld.
-    void* address = dlsym(library, symbol);
+    void* address = env->findSymbol(library, symbol);
     if (address == nullptr) return nullptr;
     if (handle != nullptr) *handle = library;
     return address;

@@ -1,5 +1,6 @@
 #include "fscanner/fs/fs_resultset_file.h"
 
+#include <fcntl.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -13,6 +14,7 @@
 #include "fscanner/fs/fs_loader.h"
 #include "fscanner/fs/fs_resultset_sort.h"
 #include "fscanner/fs/fs_serializer.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/naturalmerge.h"
 #include "fscanner/fscommon/sysfactory.h"
 #include "fscanner/fscommon/sysfile.h"
@@ -26,7 +28,7 @@ const int kExitNoTempName = 41;
 const int kFallbackNames = 20000;
 
 char* defaultTempName(char* buffer) {
-    return std::tmpnam(buffer);
+    return fscanner::Env::Current()->tempName(buffer);
 }
 
 FsResultSet_OnFile::TempNameGenerator g_tempNameGenerator = defaultTempName;
@@ -34,22 +36,19 @@ const char* g_firstPrefix = "./";
 const char* g_secondPrefix = "/tmp/";
 
 // Makes a new empty file prefix + "fsq_<n>" for the first n whose file does
-// not exist yet and can be created.  The read probe before the create is
-// what keeps two processes off one name.  Null when none can be made.
+// not exist yet and can be created.  The creation is exclusive, so two
+// processes that try one name at once cannot both take it.  Null when none
+// can be made.
 char* fallbackTempName(const char* prefix) {
     if (prefix == nullptr) return nullptr;
+    fscanner::Env* env = fscanner::Env::Current();
     char candidate[4096];
     for (int n = 0; n < kFallbackNames; ++n) {
         int written = std::snprintf(candidate, sizeof(candidate), "%sfsq_%d", prefix, n);
         if (written < 0 || static_cast<size_t>(written) >= sizeof(candidate)) return nullptr;
-        FILE* probe = std::fopen(candidate, "r");
-        if (probe != nullptr) {
-            std::fclose(probe);
-            continue;
-        }
-        FILE* created = std::fopen(candidate, "w");
-        if (created == nullptr) continue;
-        std::fclose(created);
+        int fd = env->openFile(candidate, O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0666);
+        if (fd == -1) continue;  // taken, or this directory refuses it
+        env->closeFile(fd);
         return i_strdup(candidate);
     }
     return nullptr;
@@ -72,7 +71,8 @@ void deleteFile_CleanupHandler(int code, void* name) {
     // With the file go the scratch files of a sort that may be running on it.
     if (name != nullptr) {
         const char* file = static_cast<const char*>(name);
-        ::unlink(file);
+        fscanner::Env* env = fscanner::Env::Current();
+        env->removeFile(file);
         char scratch[4096 + 8];
         size_t length = std::strlen(file);
         for (const char* suffix : {NATURAL_MERGE_SCRATCH_A, NATURAL_MERGE_SCRATCH_B}) {
@@ -80,7 +80,7 @@ void deleteFile_CleanupHandler(int code, void* name) {
             if (length + suffixLength >= sizeof scratch) break;
             std::memcpy(scratch, file, length);
             std::memcpy(scratch + length, suffix, suffixLength + 1);
-            ::unlink(scratch);
+            env->removeFile(scratch);
         }
     }
     getQvLogFs()->traceMID(__LINE__, __FILE__, __func__,
@@ -146,7 +146,7 @@ FsResultSetReader_OnFile::FsResultSetReader_OnFile(char const* filename)
 FsResultSetReader_OnFile::~FsResultSetReader_OnFile() {
     delete serializator;
     delete file;
-    if (fileName != nullptr) ::unlink(fileName);
+    if (fileName != nullptr) fscanner::Env::Current()->removeFile(fileName);
     kelm_free(fileName);
 }
 
@@ -245,7 +245,7 @@ FsResultSet_OnFile::FsResultSet_OnFile() : fileName(nullptr), reader(nullptr), w
 FsResultSet_OnFile::~FsResultSet_OnFile() {
     delete writer;
     writer = nullptr;
-    if (reader == nullptr) ::unlink(fileName);
+    if (reader == nullptr) fscanner::Env::Current()->removeFile(fileName);
     // The handler holds this very pointer; it must not outlive the name.
     FsResourceManager::getInstance()->removeCleanupHandler(deleteFile_CleanupHandler, fileName);
     kelm_free(fileName);

@@ -20,6 +20,7 @@
 #include "fscanner/fs/fs_fileinfo.h"
 #include "fscanner/fs/fs_serializer.h"
 #include "fscanner/fscommon/codec.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/expvalue.h"
 #include "fscanner/fscommon/pathhelper.h"
 #include "fscanner/fscommon/sysfile.h"
@@ -739,25 +740,26 @@ class FileImage {
 public:
     FileImage() : mapped(nullptr), length(0) {}
     ~FileImage() {
-        if (mapped != nullptr) ::munmap(mapped, length);
+        if (mapped != nullptr) fscanner::Env::Current()->unmapFile(mapped, length);
     }
     // False for a file that cannot be read or is larger than limit.
     bool load(const char* name, uint32_t limit) {
-        int fd = ::open(name, O_RDONLY | O_CLOEXEC);
+        fscanner::Env* env = fscanner::Env::Current();
+        int fd = env->openFile(name, O_RDONLY | O_CLOEXEC);
         if (fd < 0) return false;
         struct stat st;
-        bool ok = ::fstat(fd, &st) == 0 && S_ISREG(st.st_mode) && st.st_size >= 0 &&
+        bool ok = env->fileStatus(fd, &st) == 0 && S_ISREG(st.st_mode) && st.st_size >= 0 &&
                   static_cast<unsigned long long>(st.st_size) <= limit;
         if (ok && st.st_size > 0) {
             length = static_cast<size_t>(st.st_size);
-            void* p = ::mmap(nullptr, length, PROT_READ, MAP_PRIVATE | MAP_POPULATE, fd, 0);
+            void* p = env->mapFile(nullptr, length, PROT_READ, MAP_PRIVATE | MAP_POPULATE, fd, 0);
             if (p != MAP_FAILED) {
                 mapped = static_cast<unsigned char*>(p);
             } else {
                 ok = readAll(fd);
             }
         }
-        ::close(fd);
+        env->closeFile(fd);
         return ok;
     }
     const unsigned char* data() const { return mapped != nullptr ? mapped : copy.data(); }
@@ -771,7 +773,7 @@ private:
         copy.resize(length);
         size_t done = 0;
         while (done < length) {
-            ssize_t n = ::read(fd, copy.data() + done, length - done);
+            ssize_t n = fscanner::Env::Current()->readFile(fd, copy.data() + done, length - done);
             if (n < 0 && errno == EINTR) continue;
             if (n <= 0) return false;  // a file that changed under us goes to the passes
             done += static_cast<size_t>(n);
@@ -808,14 +810,7 @@ struct LoadedFile {
 };
 
 bool writeAll(int fd, const unsigned char* data, size_t length) {
-    while (length > 0) {
-        ssize_t n = ::write(fd, data, length);
-        if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) return false;
-        data += n;
-        length -= static_cast<size_t>(n);
-    }
-    return true;
+    return fscanner::WriteFully(fscanner::Env::Current(), fd, data, length);
 }
 
 // Writes the records in `order` to `scratch` through `buffer` (whose
@@ -824,8 +819,9 @@ bool writeAll(int fd, const unsigned char* data, size_t length) {
 // file left, on any failure.
 bool writeInOrder(const char* name, const char* scratch, const LoadedFile& loaded,
                   const std::vector<uint32_t>& order, std::vector<unsigned char>& buffer) {
-    ::unlink(scratch);
-    int fd = ::open(scratch, O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0660);
+    fscanner::Env* env = fscanner::Env::Current();
+    env->removeFile(scratch);
+    int fd = env->openFile(scratch, O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0660);
     if (fd < 0) return false;
     size_t capacity = buffer.capacity();
     buffer.clear();
@@ -848,9 +844,9 @@ bool writeInOrder(const char* name, const char* scratch, const LoadedFile& loade
     }
     if (ok) ok = writeAll(fd, buffer.data(), buffer.size());
     buffer.clear();
-    if (::close(fd) != 0) ok = false;
-    if (ok && ::rename(scratch, name) != 0) ok = false;
-    if (!ok) ::unlink(scratch);
+    if (env->closeFile(fd) != 0) ok = false;
+    if (ok && env->renameFile(scratch, name) != 0) ok = false;
+    if (!ok) env->removeFile(scratch);
     return ok;
 }
 

@@ -1,13 +1,35 @@
 // Reader of the automounter's master file and plain maps.  See automounter.h.
 #include "fscanner/fscommon/automounter.h"
 
+#include <sys/types.h>
+
+#include <cstdio>
+#include <cstdlib>
+
 #include "base/QvLogWrapper.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/stringhelper.h"
 
 namespace {
 
 // Tabs and blanks separate the fields of master and map lines.
 const char* const kFieldDelimiters = " \t";
+
+// The lines of a stream as std::getline gives them: without their line
+// end, the last one also when no line end follows it.
+std::vector<std::string> readLines(FILE* stream) {
+    std::vector<std::string> lines;
+    char* buffer = nullptr;
+    size_t capacity = 0;
+    ssize_t length;
+    while ((length = ::getline(&buffer, &capacity, stream)) >= 0) {
+        size_t n = static_cast<size_t>(length);
+        if (n > 0 && buffer[n - 1] == '\n') --n;
+        lines.push_back(std::string(buffer, n));
+    }
+    std::free(buffer);
+    return lines;
+}
 
 }  // namespace
 
@@ -32,11 +54,13 @@ bool PlainFileParser::isRemote(const std::vector<std::string>& tokens) {
 
 void PlainFileParser::parse(std::vector<std::string>& remote, std::vector<std::string>& local) {
     QvLogWrapper* log = getQvLogFs();
-    std::ifstream map(mapPath.c_str());
-    if (!map.is_open()) throw std::string("Unable to open automounter map file: ") + mapPath;
+    fscanner::Env* env = fscanner::Env::Current();
+    FILE* map = env->openStream(mapPath.c_str(), "r");
+    if (map == nullptr) throw std::string("Unable to open automounter map file: ") + mapPath;
+    std::vector<std::string> lines = readLines(map);
+    env->closeStream(map);
 
-    std::string line;
-    while (std::getline(map, line)) {
+    for (const std::string& line : lines) {
         log->traceMAX(__LINE__, __FILE__, __FUNCTION__, "Map entry: '%s'", line.c_str());
         if (line.empty() || line[0] == '#') continue;
 
@@ -81,15 +105,23 @@ AutomounterConfigParser::AutomounterConfigParser(const std::string& path)
 AutomounterConfigParser::~AutomounterConfigParser() {}
 
 void AutomounterConfigParser::parse() {
-    std::ifstream master(masterPath.c_str());
-    if (!master.is_open()) throw std::string("Unable to open automounter's master file ") + masterPath;
-    parseMaster(master);
-    master.close();
+    fscanner::Env* env = fscanner::Env::Current();
+    FILE* master = env->openStream(masterPath.c_str(), "r");
+    if (master == nullptr) throw std::string("Unable to open automounter's master file ") + masterPath;
+    std::vector<std::string> lines = readLines(master);
+    env->closeStream(master);
+    parseMasterLines(lines);
 }
 
 void AutomounterConfigParser::parseMaster(std::ifstream& master) {
+    std::vector<std::string> lines;
     std::string line;
-    while (std::getline(master, line)) {
+    while (std::getline(master, line)) lines.push_back(line);
+    parseMasterLines(lines);
+}
+
+void AutomounterConfigParser::parseMasterLines(const std::vector<std::string>& lines) {
+    for (const std::string& line : lines) {
         qvLog->traceMAX(__LINE__, __FILE__, __FUNCTION__, "Master file entry '%s'", line.c_str());
         // Leading white space is not stripped: an indented "#" is no comment.
         if (line.empty() || line[0] == '#' || line[0] == '+') continue;

@@ -67,6 +67,8 @@ public:
     // is of unknown format" for a line of fewer than two tokens and "Unknown
     // format of automounter master file" for a definition of more than three
     // parts.  Lines that are empty or begin with "#" or "+" are skipped.
+    // A host's stream is read as it stands; parse() itself reads the master
+    // file through the Env.
     void parseMaster(std::ifstream& master);
     // Follows one master entry: a map of type "file" is read by a
     // PlainFileParser; any other type is traced as not supported.  A string
@@ -79,6 +81,9 @@ public:
     const std::string& getMasterPath() const { return masterPath; }
 
 private:
+    // The work of parseMaster, over lines already read.
+    void parseMasterLines(const std::vector<std::string>& lines);
+
     std::vector<std::string> localMountPoints;
     std::vector<std::string> remoteMountPoints;
     std::string masterPath;

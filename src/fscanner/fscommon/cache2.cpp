@@ -7,14 +7,14 @@
 #include <cstring>
 #include <string>
 
-#include <unistd.h>
+#include <vector>
 
 #include "base/QvLogWrapper.h"
 #include "fscanner/fs/fs_query.h"
+#include "fscanner/fscommon/cache_files.h"
 
 namespace {
 
-const size_t CAT_SET_BUFFER_BYTES = 0x4000;  // 16 KiB: at most 4,095 characters a record
 const size_t CAT_SET_NAME_LIMIT = 4096;
 
 std::string catSetPath(wchar_t const* name)
@@ -25,14 +25,6 @@ std::string catSetPath(wchar_t const* name)
         buffer[0] = '\0';
     buffer[CAT_SET_NAME_LIMIT] = '\0';
     return buffer;
-}
-
-// True when the whole record went to the stream.
-bool writeRecord(FILE* f, std::wstring const& text)
-{
-    uint32_t count = static_cast<uint32_t>(text.size());
-    return fwrite(&count, 1, sizeof(count), f) == sizeof(count) &&
-           fwrite(text.data(), sizeof(wchar_t), text.size(), f) == text.size();
 }
 
 }  // namespace
@@ -78,52 +70,40 @@ void FS_Cache2::saveOrRestoreFilesOrMasksForCaching(FsQuery const& constQuery)
                       className, __func__);
         if (catSetFileName == nullptr)
             return;
-        FILE* f = fopen(path.c_str(), "rb");
-        if (f == nullptr)
+        std::vector<std::wstring> records;
+        cachefiles::ReadEnd end;
+        uint32_t damagedCount = 0;
+        if (!cachefiles::readCatalogSet(path.c_str(), &records, &end, &damagedCount))
             return;  // no saved set is no error
-        wchar_t* buffer = static_cast<wchar_t*>(malloc(CAT_SET_BUFFER_BYTES));
-        const size_t maxChars = CAT_SET_BUFFER_BYTES / sizeof(wchar_t) - 1;
-        while (buffer != nullptr) {
-            uint32_t count = 0;
-            if (fread(&count, 1, sizeof(count), f) != sizeof(count))
-                break;
-            if (count > maxChars) {
-                log->traceMIN(__LINE__, __FILE__, __func__,
-                              "%s::%s - damaged record of %u characters, reading stopped",
-                              className, __func__, static_cast<unsigned int>(count));
-                break;
-            }
-            memset(buffer, 0, CAT_SET_BUFFER_BYTES);
-            if (fread(buffer, sizeof(wchar_t), count, f) != count)
-                break;
-            query.addFileOrMaskForCaching(static_cast<wchar_t const*>(buffer));
-        }
-        free(buffer);
-        fclose(f);
+        // Each record is sorted into a name or a mask again; the records
+        // before a damaged or cut one are kept.
+        for (size_t i = 0; i < records.size(); ++i)
+            query.addFileOrMaskForCaching(records[i].c_str());
+        if (end == cachefiles::DAMAGED_RECORD)
+            log->traceMIN(__LINE__, __FILE__, __func__,
+                          "%s::%s - damaged record of %u characters, reading stopped",
+                          className, __func__, static_cast<unsigned int>(damagedCount));
         return;
     }
     log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - dumping catalog set to cache.", className,
                   __func__);
     if (catSetFileName == nullptr)
         return;
-    FILE* f = fopen(path.c_str(), "wb");
-    if (f == nullptr)
-        return;
-    bool written = true;
+    // Exact names in set order, then masks in vector order.
+    std::vector<std::wstring> records;
     std::set<std::wstring>& names = query.getFilesForCaching();
-    for (std::set<std::wstring>::const_iterator it = names.begin(); it != names.end(); ++it)
-        written = written && writeRecord(f, *it);
+    records.insert(records.end(), names.begin(), names.end());
     std::vector<std::wstring>& masks = query.getMasksForCaching();
-    for (size_t i = 0; i < masks.size(); ++i)
-        written = written && writeRecord(f, masks[i]);
-    written = fflush(f) == 0 && written;
-    int reason = errno;
-    written = fclose(f) == 0 && written;
-    if (!written) {
+    records.insert(records.end(), masks.begin(), masks.end());
+    bool opened = false;
+    if (!cachefiles::writeCatalogSet(path.c_str(), records, &opened)) {
+        if (!opened)
+            return;
+        int reason = errno;
         // A set cut short by a full disk would be restored as a smaller set
         // and quietly narrow what later builds keep.  No saved set is the
         // state a reader knows how to take.
-        unlink(path.c_str());
+        cachefiles::removeSideFile(path.c_str());
         log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - cannot write '%s': %s; it is removed",
                       className, __func__, path.c_str(), strerror(reason));
     }

@@ -7,6 +7,8 @@
 
 #include "base/KelCfg.h"
 #include "base/String.h"
+#include "fscanner/fscommon/cache_files.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/stringhelper.h"
 
 int getNestedFolderDepthForLogging()
@@ -33,11 +35,8 @@ bool openFolderListLogfile(FILE** file)
         return true;
     }
     String dir = KelCfg::getKey(String("common_trace_path"));
-    const char* dirText = dir;
-    std::string path = dirText != nullptr ? dirText : "";
-    path += "/";
-    path += SCANNED_DIRS_LOG_NAME;
-    *file = fopen(path.c_str(), "w");
+    std::string path = cachefiles::folderLogPath(dir);
+    *file = fscanner::Env::Current()->openStream(path.c_str(), "w");
     if (*file == nullptr)
         return true;
     fputs(SCANNED_DIRS_LOG_HEADING, *file);
@@ -48,7 +47,7 @@ int closeFolderListLogfile(FILE** file)
 {
     if (file == nullptr || *file == nullptr)
         return 0;
-    int rc = fclose(*file);
+    int rc = fscanner::Env::Current()->closeStream(*file);
     *file = nullptr;
     return rc;
 }

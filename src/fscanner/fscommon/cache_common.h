@@ -1,18 +1,6 @@
-// Shared pieces of the cache engine: the on-disk layout of the validity marks
-// and the scanned-folder log.
-//
-// ex_hash, at <cache directory>/ex_hash: records back to back, no header, no
-// count.  One record:
-//   offset 0   4 bytes, host order   length of the key in bytes
-//   offset 4   length bytes          root path, multibyte, no terminator, without
-//                                    one trailing "/" or "\"; the root "/" has an
-//                                    empty key
-//   offset 4+length  16 bytes        raw MD5 over the root's exclude list (16 zero
-//                                    bytes for an empty list)
-// Only valid map entries are written; the file is rewritten whole each time.
-//
-// pr_hash, at <cache directory>/pr_hash: exactly 16 bytes, the raw MD5 of the
-// provider name.
+// Shared pieces of the cache engine: the constants of the validity digests
+// and the scanned-folder log.  The mark files themselves, their layout, reader
+// and writer, are in cache_files.h.
 //
 // Scanned-folder log, at <common_trace_path>/traceKEL_scanned_dirs.log: plain
 // text, emptied at each opening, a heading line and one line per directory.
@@ -27,17 +15,12 @@
 #include "fscanner/fs/fs_fileinfo.h"
 
 namespace cachemarks {
-const char EX_HASH_FILE_NAME[] = "ex_hash";
-const char PR_HASH_FILE_NAME[] = "pr_hash";
-const size_t RECORD_LENGTH_SIZE = 4;       // uint32_t, host order
-const size_t DIGEST_SIZE = 16;             // raw MD5
-const size_t MAX_KEY_LENGTH = 4095;        // a longer record is damage
+const size_t MAX_KEY_LENGTH = 4095;        // a longer key is damage
 const size_t PATH_BUFFER_SIZE = 4096;      // conversions stop at size - 1 bytes
 const char PATHS_BREAK_MARKER[] = "**BREAK**";
 const size_t PATHS_BREAK_FED = 9;          // bytes of the buffer fed after the marker
 }  // namespace cachemarks
 
-const char SCANNED_DIRS_LOG_NAME[] = "traceKEL_scanned_dirs.log";
 const char SCANNED_DIRS_LOG_HEADING[] = "LIST OF SCANNED DIRECTORIES DURING SOFTWARE SCAN:\n";
 const int DEFAULT_NESTED_FOLDER_DEPTH = 4;
 

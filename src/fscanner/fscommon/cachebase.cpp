@@ -13,9 +13,11 @@
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
 #include "fscanner/fscommon/cache_common.h"
+#include "fscanner/fscommon/cache_files.h"
 #include "fscanner/fscommon/cachetables.h"
 #include "fscanner/fscommon/checksum.h"
 #include "fscanner/fscommon/drivehelper.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/fsbuild.h"
 #include "fscanner/fs/fs_query.h"
 #include <ctime>
@@ -35,19 +37,6 @@ wchar_t* wideDup(wchar_t const* text)
     if (copy != nullptr)
         wmemcpy(copy, text, n);
     return copy;
-}
-
-wchar_t* wideJoin(wchar_t const* a, wchar_t const* b)
-{
-    if (a == nullptr || b == nullptr)
-        return nullptr;
-    size_t la = wcslen(a), lb = wcslen(b);
-    wchar_t* out = static_cast<wchar_t*>(kelm_malloc((la + lb + 1) * sizeof(wchar_t)));
-    if (out == nullptr)
-        return nullptr;
-    wmemcpy(out, a, la);
-    wmemcpy(out + la, b, lb + 1);
-    return out;
 }
 
 // Converts text into buffer (zeroed first) with at most limit bytes.  A text
@@ -136,7 +125,7 @@ bool ProviderHash::setCachePath(wchar_t const* cachePath)
 {
     if (cachePath == nullptr)
         return false;
-    wchar_t* name = wideJoin(cachePath, L"/pr_hash");
+    wchar_t* name = cachefiles::providerDigestPath(cachePath);
     if (name == nullptr)
         return false;
     kelm_free(fileName);
@@ -146,16 +135,18 @@ bool ProviderHash::setCachePath(wchar_t const* cachePath)
 
 bool ProviderHash::readMd5OfProvider()
 {
+    return readMd5OfProvider(nullptr);
+}
+
+bool ProviderHash::readMd5OfProvider(bool* exact)
+{
+    if (exact != nullptr)
+        *exact = false;
     if (fileName == nullptr)
         return false;
     char path[cachemarks::PATH_BUFFER_SIZE];
     toNarrow(fileName, path, sizeof(path), sizeof(path) - 1);
-    FILE* f = fopen(path, "rb");
-    if (f == nullptr)
-        return false;
-    size_t got = fread(digest, 1, sizeof(digest), f);
-    fclose(f);
-    return got == sizeof(digest);
+    return cachefiles::readProviderDigest(path, digest, exact);
 }
 
 bool ProviderHash::compareMd5OfProvider(wchar_t const* name)
@@ -177,12 +168,7 @@ bool ProviderHash::writeMd5File()
         return false;
     char path[cachemarks::PATH_BUFFER_SIZE];
     toNarrow(fileName, path, sizeof(path), sizeof(path) - 1);
-    FILE* f = fopen(path, "wb");
-    if (f == nullptr)
-        return false;
-    size_t put = fwrite(digest, 1, sizeof(digest), f);
-    int rc = fclose(f);
-    return put == sizeof(digest) && rc == 0;
+    return cachefiles::writeProviderDigest(path, digest);
 }
 
 // --- FS_CacheBase -------------------------------------------------------------
@@ -216,18 +202,13 @@ FS_CacheBase::FS_CacheBase(wchar_t const* directoriesTable, wchar_t const* files
                       __func__);
         return;
     }
-    exHashFileName = getCacheFileName(cachePathName, L"ex_hash", L"");
-    catSetFileName = getCacheFileName(cachePathName, L"cat_set", L"");
+    exHashFileName = cachefiles::excludeDigestsPath(cachePathName);
+    catSetFileName = cachefiles::catalogSetPath(cachePathName);
     providerHash.setCachePath(cachePathName);
-    mutexName = wideJoin(cachePathName, L"_c_mutex");
+    // One lock per real directory.
+    mutexName = cachefiles::accessMutexName(cachePathName);
     if (mutexName == nullptr)
         return;
-    // One lock per real directory; the name carries no separators so that it
-    // can itself be a file name.
-    for (wchar_t* p = mutexName; *p != L'\0'; ++p) {
-        if (*p == PathHelper::PathSeparator || *p == L':')
-            *p = L'_';
-    }
     log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - accessMutex name is '%ls'", className,
                   __func__, mutexName);
     accessMutex = SysFactory::createMutex(mutexName);
@@ -600,15 +581,16 @@ void FS_CacheBase::traceCacheDirectoryProblem()
     if (cachePathName == nullptr)
         return;
     std::string directory = narrowName(cachePathName);
+    fscanner::Env* env = fscanner::Env::Current();
     struct stat status;
     char const* problem = nullptr;
     int error = 0;
-    if (stat(directory.c_str(), &status) != 0) {
+    if (env->status(directory.c_str(), &status) != 0) {
         error = errno;
         problem = error == ENOENT ? "does not exist" : "cannot be examined";
     } else if (!S_ISDIR(status.st_mode)) {
         problem = "is not a directory";
-    } else if (access(directory.c_str(), W_OK | X_OK) != 0) {
+    } else if (env->checkAccess(directory.c_str(), W_OK | X_OK) != 0) {
         error = errno;
         problem = "is not writable";
     } else if (reason == ENOSPC || reason == EDQUOT) {
@@ -629,16 +611,10 @@ bool FS_CacheBase::insideCacheUpdate()
                       __func__);
         return false;
     }
-    wchar_t* name = getCacheFileName(cachePathName, directoriesTableName, L".cuflag");
+    wchar_t* name = cachefiles::updateFlagPath(cachePathName, directoriesTableName);
     bool inside = false;
     if (name != nullptr) {
-        AbstractMmFile* file = SysFactory::createMmFile(name);
-        if (file != nullptr) {
-            inside = file->open();
-            if (inside)
-                file->close();
-            delete file;
-        }
+        inside = cachefiles::updateFlagPresent(narrowName(name).c_str());
         delete[] name;
     }
     log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - inside cache update = %s", className,
@@ -650,17 +626,12 @@ void FS_CacheBase::beginCacheUpdate()
 {
     if (!cacheChecker)
         return;
-    wchar_t* name = getCacheFileName(cachePathName, directoriesTableName, L".cuflag");
+    wchar_t* name = cachefiles::updateFlagPath(cachePathName, directoriesTableName);
     if (name == nullptr)
         return;
     log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - begin cache update: %ls", className,
                   __func__, name);
-    AbstractMmFile* file = SysFactory::createMmFile(name);
-    if (file != nullptr) {
-        if (file->create())
-            file->close();
-        delete file;
-    }
+    cachefiles::createUpdateFlag(narrowName(name).c_str());
     delete[] name;
 }
 
@@ -668,27 +639,24 @@ void FS_CacheBase::endCacheUpdate()
 {
     if (!cacheChecker)
         return;
-    wchar_t* name = getCacheFileName(cachePathName, directoriesTableName, L".cuflag");
+    wchar_t* name = cachefiles::updateFlagPath(cachePathName, directoriesTableName);
     if (name == nullptr)
         return;
     log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - end cache update: %ls", className,
                   __func__, name);
-    unlink(narrowName(name).c_str());
+    cachefiles::removeSideFile(narrowName(name).c_str());
     delete[] name;
 }
 
 bool FS_CacheBase::getDirectoriesIDCounter()
 {
-    wchar_t* name = getCacheFileName(cachePathName, directoriesTableName, L".counter");
+    wchar_t* name = cachefiles::counterPath(cachePathName, directoriesTableName);
     if (name == nullptr)
         return false;
-    FILE* f = fopen(narrowName(name).c_str(), "rb");
+    std::string path = narrowName(name);
     delete[] name;
-    if (f == nullptr)
-        return false;
     uint32_t value = 0;
-    bool ok = fread(&value, 1, 4, f) == 4;
-    fclose(f);
+    bool ok = cachefiles::readCounter(path.c_str(), &value);
     if (ok)
         directoriesIndex = value;
     return ok;
@@ -696,38 +664,20 @@ bool FS_CacheBase::getDirectoriesIDCounter()
 
 bool FS_CacheBase::updateDirectoriesIDCounter()
 {
-    wchar_t* name = getCacheFileName(cachePathName, directoriesTableName, L".counter");
+    wchar_t* name = cachefiles::counterPath(cachePathName, directoriesTableName);
     if (name == nullptr)
         return false;
     std::string path = narrowName(name);
     delete[] name;
-    // An existing counter is overwritten in place: its four bytes already
-    // have their block, so a full disk cannot leave it cut short, which
-    // would make the next open refuse (and remove) the whole cache.  Only a
-    // missing one is made anew.
-    FILE* f = fopen(path.c_str(), "r+b");
-    if (f == nullptr)
-        f = fopen(path.c_str(), "wb");
-    if (f == nullptr)
-        return false;
-    uint32_t value = directoriesIndex;
-    bool ok = fwrite(&value, 1, 4, f) == 4 && fflush(f) == 0;
-    // A longer file (not one of ours) is cut to the four bytes, as a new one
-    // would be.
-    ok = ok && ftruncate(fileno(f), 4) == 0;
-    int reason = errno;
-    ok = fclose(f) == 0 && ok;
-    if (!ok)
-        errno = reason;
-    return ok;
+    return cachefiles::writeCounter(path.c_str(), directoriesIndex);
 }
 
 void FS_CacheBase::removeDirectoriesIDCounter()
 {
-    wchar_t* name = getCacheFileName(cachePathName, directoriesTableName, L".counter");
+    wchar_t* name = cachefiles::counterPath(cachePathName, directoriesTableName);
     if (name == nullptr)
         return;
-    unlink(narrowName(name).c_str());
+    cachefiles::removeSideFile(narrowName(name).c_str());
     delete[] name;
 }
 
@@ -735,26 +685,13 @@ void FS_CacheBase::removeCatSet()
 {
     if (catSetFileName == nullptr)
         return;
-    unlink(narrowName(catSetFileName).c_str());
+    cachefiles::removeSideFile(narrowName(catSetFileName).c_str());
 }
 
 wchar_t* FS_CacheBase::getCacheFileName(wchar_t const* directory, wchar_t const* name,
                                         wchar_t const* suffix)
 {
-    if (directory == nullptr || name == nullptr || suffix == nullptr)
-        return nullptr;
-    size_t ld = wcslen(directory);
-    bool needSeparator = ld == 0 || directory[ld - 1] != L'/';
-    size_t total = ld + (needSeparator ? 1 : 0) + wcslen(name) + wcslen(suffix) + 1;
-    wchar_t* out = new (std::nothrow) wchar_t[total];
-    if (out == nullptr)
-        return nullptr;
-    wcscpy(out, directory);
-    if (needSeparator)
-        wcscat(out, L"/");
-    wcscat(out, name);
-    wcscat(out, suffix);
-    return out;
+    return cachefiles::cacheFileName(directory, name, suffix);
 }
 
 void FS_CacheBase::getMd5OfPaths(std::vector<PathInfo>& included, std::vector<PathInfo>& excluded,
@@ -870,26 +807,25 @@ void FS_CacheBase::writeMd5File()
         return;
     char path[cachemarks::PATH_BUFFER_SIZE + 1];
     toNarrow(exHashFileName, path, sizeof(path), cachemarks::PATH_BUFFER_SIZE);
-    FILE* f = fopen(path, "wb");
-    if (f == nullptr)
-        return;
-    bool written = true;
+    std::vector<cachefiles::ExcludeDigest> records;
     for (std::map<std::string, ExcludeMD5>::const_iterator it = excludeMd5.begin();
          it != excludeMd5.end(); ++it) {
-        log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - md5 write of '%s'", className,
-                      __func__, it->first.c_str());
         if (!it->second.valid)
             continue;
-        uint32_t length = static_cast<uint32_t>(it->first.size());
-        written = written && fwrite(&length, 1, cachemarks::RECORD_LENGTH_SIZE, f) ==
-                                 cachemarks::RECORD_LENGTH_SIZE;
-        written = written && fwrite(it->first.data(), 1, it->first.size(), f) == it->first.size();
-        written = written && fwrite(it->second.digest, 1, cachemarks::DIGEST_SIZE, f) ==
-                                 cachemarks::DIGEST_SIZE;
+        cachefiles::ExcludeDigest record;
+        record.key = it->first;
+        memcpy(record.digest, it->second.digest, sizeof(record.digest));
+        records.push_back(record);
     }
-    written = fflush(f) == 0 && written;
+    bool opened = false;
+    bool written = cachefiles::writeExcludeDigests(path, records, &opened);
     int reason = errno;
-    written = fclose(f) == 0 && written;
+    if (!opened)
+        return;  // a mark that cannot be made is a missing mark: silent
+    for (std::map<std::string, ExcludeMD5>::const_iterator it = excludeMd5.begin();
+         it != excludeMd5.end(); ++it)
+        log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - md5 write of '%s'", className,
+                      __func__, it->first.c_str());
     // A file cut short by a full disk holds only whole records before the
     // cut, which the reader keeps; the roots whose records are missing count
     // as built under other excludes and are rebuilt.  That is the promise of
@@ -905,30 +841,21 @@ void FS_CacheBase::readMd5OfExclude()
         return;
     char path[cachemarks::PATH_BUFFER_SIZE + 1];
     toNarrow(exHashFileName, path, sizeof(path), cachemarks::PATH_BUFFER_SIZE);
-    FILE* f = fopen(path, "rb");
-    if (f == nullptr)
+    std::vector<cachefiles::ExcludeDigest> records;
+    cachefiles::ReadEnd end;
+    uint32_t damagedLength = 0;
+    if (!cachefiles::readExcludeDigests(path, &records, &end, &damagedLength))
         return;
-    char key[cachemarks::PATH_BUFFER_SIZE];
-    for (;;) {
-        uint32_t length = 0;
-        if (fread(&length, 1, cachemarks::RECORD_LENGTH_SIZE, f) != cachemarks::RECORD_LENGTH_SIZE)
-            break;
-        if (length > cachemarks::MAX_KEY_LENGTH) {
-            log->traceMIN(__LINE__, __FILE__, __func__,
-                          "%s::%s - damaged record length %u in '%s', reading stopped", className,
-                          __func__, static_cast<unsigned int>(length), path);
-            break;
-        }
-        memset(key, 0, sizeof(key));
-        if (fread(key, 1, length, f) != length)
-            break;
+    // Whatever stopped the reading, the whole records before it count.
+    for (size_t i = 0; i < records.size(); ++i) {
         unsigned int digest[4];
-        if (fread(digest, 1, cachemarks::DIGEST_SIZE, f) != cachemarks::DIGEST_SIZE)
-            break;
-        std::string name(key, length);
-        excludeMd5[name].update(name.c_str(), &digest);
+        memcpy(digest, records[i].digest, sizeof(digest));
+        excludeMd5[records[i].key].update(records[i].key.c_str(), &digest);
     }
-    fclose(f);
+    if (end == cachefiles::DAMAGED_RECORD)
+        log->traceMIN(__LINE__, __FILE__, __func__,
+                      "%s::%s - damaged record length %u in '%s', reading stopped", className,
+                      __func__, static_cast<unsigned int>(damagedLength), path);
 }
 
 void FS_CacheBase::removeMd5FromExcludes()
@@ -937,7 +864,7 @@ void FS_CacheBase::removeMd5FromExcludes()
         return;
     char path[cachemarks::PATH_BUFFER_SIZE + 1];
     toNarrow(exHashFileName, path, sizeof(path), cachemarks::PATH_BUFFER_SIZE);
-    unlink(path);
+    cachefiles::removeSideFile(path);
 }
 
 // --- query driver ---------------------------------------------------------------
@@ -1102,7 +1029,8 @@ int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery con
     std::string md5;
     getMd5OfPaths(prevIncludedPaths, prevExcludedPaths, md5);
     bool cacheValid;
-    if (!providerHash.readMd5OfProvider()) {
+    bool markExact = false;
+    if (!providerHash.readMd5OfProvider(&markExact)) {
         cacheValid = false;
         log->traceMID(__LINE__, __FILE__, __func__,
                       "%s::%s - (cacheValid check1) unable to determine previous provider, therefore cache is invalid.",
@@ -1115,7 +1043,11 @@ int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery con
     } else {
         cacheValid = true;
     }
-    if (!providerHash.updateMd5OfProvider())
+    // A mark that already holds exactly this provider's digest is left
+    // alone: rewriting the same 16 bytes at every query only dirties the
+    // directory's disk for the next sync.
+    bool markCurrent = cacheValid && markExact;
+    if (!markCurrent && !providerHash.updateMd5OfProvider())
         log->traceMID(__LINE__, __FILE__, __func__,
                       "%s::%s - (cacheValid check1) failed to update previous cache MD5 for future scans!",
                       className, __func__);

@@ -71,6 +71,9 @@ public:
     bool setCachePath(wchar_t const* cachePath);
     // Reads 16 bytes into digest; false with no fileName, no file or a short read.
     bool readMd5OfProvider();
+    // The same; *exact then tells whether the file holds those 16 bytes and
+    // nothing more, as writeMd5File leaves it.
+    bool readMd5OfProvider(bool* exact);
     // Digests name like updateMd5OfProvider and compares with digest, unchanged.
     bool compareMd5OfProvider(wchar_t const* name);
     // Digests providerName into digest and writes the file.

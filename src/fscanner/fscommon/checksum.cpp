@@ -11,6 +11,7 @@
 
 #include "base/CpuThreshold.h"
 #include "base/QvLogWrapper.h"
+#include "fscanner/fscommon/env.h"
 
 bool operator==(u_int128 const& a, u_int128 const& b) {
     return std::memcmp(a.bytes, b.bytes, sizeof a.bytes) == 0;
@@ -445,33 +446,34 @@ namespace {
 // untouched.
 FILE* openForSums(char const* path, bool followLinks, bool directories) {
     if (path == nullptr) return nullptr;
+    fscanner::Env* env = fscanner::Env::Current();
     int flags = O_RDONLY | O_NONBLOCK | O_CLOEXEC;
     if (!followLinks) flags |= O_NOFOLLOW;
-    int fd = ::open(path, flags);
+    int fd = env->openFile(path, flags);
     if (fd < 0) return nullptr;
     struct stat status;
-    if (::fstat(fd, &status) != 0) {
+    if (env->fileStatus(fd, &status) != 0) {
         int error = errno;
-        ::close(fd);
+        env->closeFile(fd);
         errno = error;
         return nullptr;
     }
     if (!S_ISREG(status.st_mode) && !(directories && S_ISDIR(status.st_mode))) {
-        ::close(fd);
+        env->closeFile(fd);
         errno = EINVAL;
         return nullptr;
     }
-    int mode = ::fcntl(fd, F_GETFL);
-    if (mode < 0 || ::fcntl(fd, F_SETFL, mode & ~O_NONBLOCK) != 0) {
+    int mode = env->fileControl(fd, F_GETFL, 0);
+    if (mode < 0 || env->fileControl(fd, F_SETFL, mode & ~O_NONBLOCK) != 0) {
         int error = errno;
-        ::close(fd);
+        env->closeFile(fd);
         errno = error;
         return nullptr;
     }
-    FILE* file = ::fdopen(fd, "rb");
+    FILE* file = env->openStreamOnFd(fd, "rb");
     if (file == nullptr) {
         int error = errno;
-        ::close(fd);
+        env->closeFile(fd);
         errno = error;
     }
     return file;
@@ -563,7 +565,7 @@ int computeSums(FileChecksumInfo& info, char const* path, bool followLinks, bool
     info.q32 = crc32_final(&q32Ctx);
     md5_final(&md5Ctx, info.md5.bytes);
     sha256_final(&shaCtx, info.sha256.bytes);
-    std::fclose(file);
+    fscanner::Env::Current()->closeStream(file);
     return result;
 }
 

@@ -11,6 +11,7 @@
 
 #include "base/CpuThreshold.h"
 #include "base/QvLogWrapper.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/automounter.h"
 #include "fscanner/fscommon/mountlist.h"
 #include "fscanner/fscommon/wildcard.h"
@@ -70,10 +71,11 @@ void accessToAllMountPaths() {
                           "accessToAllMountPaths - skipping - assuming remote");
             continue;
         }
-        DIR* directory = opendir(dir);
+        fscanner::Env* env = fscanner::Env::Current();
+        DIR* directory = env->openDirectory(dir);
         if (!directory) continue;
         struct dirent* item;
-        while ((item = readdir(directory)) != nullptr) {
+        while ((item = env->readDirectory(directory)) != nullptr) {
             if (strcmp(item->d_name, ".") == 0 || strcmp(item->d_name, "..") == 0) continue;
             char path[4096];
             int written = snprintf(path, sizeof(path), "%s/%s/__dummy__", dir, item->d_name);
@@ -81,9 +83,9 @@ void accessToAllMountPaths() {
             // The look-up alone makes the automounter mount that key; the
             // answer does not matter.
             struct stat status;
-            (void)stat(path, &status);
+            (void)env->status(path, &status);
         }
-        closedir(directory);
+        env->closeDirectory(directory);
     }
 }
 

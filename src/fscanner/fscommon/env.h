@@ -22,6 +22,7 @@
 
 #include <cstdint>
 #include <cstdio>
+#include <string>
 
 namespace fscanner {
 
@@ -105,7 +106,28 @@ public:
     virtual void* findSymbol(void* library, const char* symbol) = 0;
     virtual int unloadLibrary(void* library) = 0;
     virtual const char* libraryError() = 0;
+
+    // ------------------------------------------------------- descriptors
+    // fcntl(2) with an integer argument, ioctl(2) with a pointer argument.
+    virtual int fileControl(int fd, int command, long argument) = 0;
+    virtual int deviceControl(int fd, unsigned long request, void* argument) = 0;
+
+    // rmdir(2).
+    virtual int removeDirectory(const char* path) = 0;
+    // tmpnam(3): proposes a name that no file has yet, creating nothing;
+    // null when there is none.
+    virtual char* tempName(char* buffer) = 0;
 };
+
+// Reads the whole of path (opened read-only) into *content, replacing what
+// it held.  False, errno set, when the file cannot be opened or a read
+// fails; *content then holds what was read before the failure.
+bool ReadFileToString(Env* env, const char* path, std::string* content);
+
+// Writes all length bytes at the descriptor's offset, again after a short
+// write or an interrupted call.  False, errno set, when a write fails or
+// writes nothing.
+bool WriteFully(Env* env, int fd, const void* data, size_t length);
 
 // Forwards every call to a target Env (not owned).  Subclass it and
 // override the calls to change; the rest keep the target's behaviour.
@@ -192,6 +214,14 @@ public:
     }
     int unloadLibrary(void* library) override { return target_->unloadLibrary(library); }
     const char* libraryError() override { return target_->libraryError(); }
+    int fileControl(int fd, int command, long argument) override {
+        return target_->fileControl(fd, command, argument);
+    }
+    int deviceControl(int fd, unsigned long request, void* argument) override {
+        return target_->deviceControl(fd, request, argument);
+    }
+    int removeDirectory(const char* path) override { return target_->removeDirectory(path); }
+    char* tempName(char* buffer) override { return target_->tempName(buffer); }
 
 private:
     Env* target_;

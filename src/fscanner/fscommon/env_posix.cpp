@@ -3,10 +3,13 @@
 #include <fcntl.h>
 #include <limits.h>
 #include <sys/file.h>
+#include <sys/ioctl.h>
 #include <sys/mman.h>
 #include <unistd.h>
 
 #include <atomic>
+#include <cerrno>
+#include <cstdio>
 #include <cstdlib>
 
 #include "fscanner/fscommon/env.h"
@@ -73,6 +76,16 @@ public:
     void* findSymbol(void* library, const char* symbol) override { return ::dlsym(library, symbol); }
     int unloadLibrary(void* library) override { return ::dlclose(library); }
     const char* libraryError() override { return ::dlerror(); }
+    int fileControl(int fd, int command, long argument) override { return ::fcntl(fd, command, argument); }
+    int deviceControl(int fd, unsigned long request, void* argument) override {
+        return ::ioctl(fd, request, argument);
+    }
+    int removeDirectory(const char* path) override { return ::rmdir(path); }
+    char* tempName(char* buffer) override {
+        // The contract of the result files names tmpnam for their first
+        // step: a name only, nothing created until the writer makes it.
+        return std::tmpnam(buffer);
+    }
 };
 
 std::atomic<Env*> installed{nullptr};
@@ -94,6 +107,46 @@ Env* Env::Current() {
 Env* Env::Install(Env* env) {
     Env* before = installed.exchange(env, std::memory_order_acq_rel);
     return before != nullptr ? before : Default();
+}
+
+bool ReadFileToString(Env* env, const char* path, std::string* content) {
+    content->clear();
+    int fd;
+    do {
+        fd = env->openFile(path, O_RDONLY | O_CLOEXEC);
+    } while (fd == -1 && errno == EINTR);
+    if (fd == -1) return false;
+    char buffer[8192];
+    bool ok = true;
+    for (;;) {
+        ssize_t n = env->readFile(fd, buffer, sizeof buffer);
+        if (n < 0 && errno == EINTR) continue;
+        if (n < 0) {
+            ok = false;
+            break;
+        }
+        if (n == 0) break;
+        content->append(buffer, static_cast<size_t>(n));
+    }
+    int error = errno;
+    env->closeFile(fd);
+    if (!ok) errno = error;
+    return ok;
+}
+
+bool WriteFully(Env* env, int fd, const void* data, size_t length) {
+    const char* bytes = static_cast<const char*>(data);
+    while (length > 0) {
+        ssize_t n = env->writeFile(fd, bytes, length);
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) {
+            if (n == 0) errno = ENOSPC;
+            return false;
+        }
+        bytes += n;
+        length -= static_cast<size_t>(n);
+    }
+    return true;
 }
 
 }  // namespace fscanner

@@ -11,6 +11,7 @@
 
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/stringhelper.h"
 #include "fscanner/fscommon/utils.h"
 
@@ -225,7 +226,7 @@ char* FileTypeChecker::makeCommand(char const* format, char const* argument, cha
 
 FILE* FileTypeChecker::openCommand(char const* cmd, char const* function) {
     log->traceMAX(__LINE__, __FILE__, function, "FileTypeChecker::%s - running '%s'\n", function, cmd);
-    FILE* pipe = popen(cmd, "r");
+    FILE* pipe = fscanner::Env::Current()->openPipe(cmd, "r");
     if (pipe == nullptr) {
         log->traceMAX(__LINE__, __FILE__, function, "FileTypeChecker::check - cannot open '%s' cmd file!\n",
                       cmd);
@@ -274,7 +275,7 @@ bool FileTypeChecker::getFileType(wchar_t const* path, wchar_t** out) {
             break;
         }
     }
-    pclose(pipe);
+    fscanner::Env::Current()->closePipe(pipe);
     if (!found) return false;
 
     if (!toWide(lineBuffer, wbuffer, BUFFER_SIZE)) {
@@ -320,7 +321,7 @@ bool FileTypeChecker::runBatch(char const* cmd, char const* prefix, wchar_t cons
             cache.insert(Element(batch, wbuffer));
         }
     }
-    pclose(pipe);
+    fscanner::Env::Current()->closePipe(pipe);
     batchNumber() = batch % BATCH_MODULUS + 1;
     return true;
 }
@@ -385,7 +386,8 @@ bool FileTypeChecker::lookUpInDirectory(wchar_t const* path, wchar_t** out, bool
         // `cd` failing would let `ls` list the working directory under this
         // directory's name, and a listed name that begins with "-" would reach
         // `file` as an option.  Either way no answer could be trusted.
-        DIR* handle = opendir(dir.c_str());
+        fscanner::Env* env = fscanner::Env::Current();
+        DIR* handle = env->openDirectory(dir.c_str());
         if (handle == nullptr) {
             log->traceMAX(__LINE__, __FILE__, function,
                           "FileTypeChecker::getFileTypeEx - cannot open directory '%s'; not run\n",
@@ -393,7 +395,8 @@ bool FileTypeChecker::lookUpInDirectory(wchar_t const* path, wchar_t** out, bool
             return false;
         }
         bool optionName = false;
-        for (struct dirent* entry = readdir(handle); entry != nullptr; entry = readdir(handle)) {
+        for (struct dirent* entry = env->readDirectory(handle); entry != nullptr;
+             entry = env->readDirectory(handle)) {
             if (entry->d_name[0] == '-') {
                 log->traceMAX(__LINE__, __FILE__, function,
                               "FileTypeChecker::getFileTypeEx - entry '%s' of '%s' would be read as an "
@@ -403,7 +406,7 @@ bool FileTypeChecker::lookUpInDirectory(wchar_t const* path, wchar_t** out, bool
                 break;
             }
         }
-        closedir(handle);
+        env->closeDirectory(handle);
         if (optionName) return false;
 
         char* cmd = makeCommand(DIRECTORY_COMMAND, dir.c_str(), function);
@@ -453,18 +456,19 @@ bool FileTypeChecker::lookUpInDirectory(wchar_t const* path, wchar_t** out, bool
 
 int FileTypeChecker::makeListFile(char const* dir, char const* listFile) {
     if (dir == nullptr || listFile == nullptr) return -1;
-    FILE* list = fopen(listFile, "w+");
+    fscanner::Env* env = fscanner::Env::Current();
+    FILE* list = env->openStream(listFile, "w+");
     if (list == nullptr) return -1;
-    DIR* handle = opendir(dir);
+    DIR* handle = env->openDirectory(dir);
     if (handle == nullptr) {
-        fclose(list);
+        env->closeStream(list);
         return -1;
     }
     size_t dirLength = strlen(dir);
     bool separator = dirLength == 0 || dir[dirLength - 1] != '/';
     int written = 0;
     bool failed = false;
-    for (struct dirent* entry = readdir(handle); entry != nullptr; entry = readdir(handle)) {
+    for (struct dirent* entry = env->readDirectory(handle); entry != nullptr; entry = env->readDirectory(handle)) {
         // The end mark takes part in the comparison, so ".profile" or "..x"
         // are kept and only "." and ".." themselves are passed over.
         if (memcmp(entry->d_name, ".", 2) == 0 || memcmp(entry->d_name, "..", 3) == 0) continue;
@@ -472,7 +476,7 @@ int FileTypeChecker::makeListFile(char const* dir, char const* listFile) {
         if (separator) full += '/';
         full += entry->d_name;
         struct stat status;
-        if (lstat(full.c_str(), &status) != 0) {
+        if (env->linkStatus(full.c_str(), &status) != 0) {
             log->traceMAX(__LINE__, __FILE__, "makeListFile", "::makeListFile - stat on '%s' file failed!\n",
                           full.c_str());
             failed = true;
@@ -485,8 +489,8 @@ int FileTypeChecker::makeListFile(char const* dir, char const* listFile) {
         }
         ++written;
     }
-    closedir(handle);
-    if (fclose(list) != 0) failed = true;
+    env->closeDirectory(handle);
+    if (env->closeStream(list) != 0) failed = true;
     return failed ? -1 : written;
 }
 
@@ -612,7 +616,8 @@ int FileTypeChecker::check(wchar_t const* listFile, StringList<wchar_t>& include
 
     std::string name;
     FILE* list = nullptr;
-    if (toNarrow(listFile, name)) list = fopen(name.c_str(), "r");
+    fscanner::Env* env = fscanner::Env::Current();
+    if (toNarrow(listFile, name)) list = env->openStream(name.c_str(), "r");
     if (list == nullptr) {
         log->traceMAX(__LINE__, __FILE__, function, "FileTypeChecker::check - cannot open '%S' data file!\n",
                       listFile);
@@ -626,18 +631,18 @@ int FileTypeChecker::check(wchar_t const* listFile, StringList<wchar_t>& include
                       "FileTypeChecker::check - list file name '%s' holds shell syntax (0x%02x) or begins "
                       "with '-'; not run\n",
                       name.c_str(), static_cast<unsigned int>(static_cast<unsigned char>(bad)));
-        fclose(list);
+        env->closeStream(list);
         return -1;
     }
     char* cmd = makeCommand(LIST_COMMAND, name.c_str(), function);
     if (cmd == nullptr) {
-        fclose(list);
+        env->closeStream(list);
         return -1;
     }
     FILE* pipe = openCommand(cmd, function);
     kelm_free(cmd);
     if (pipe == nullptr) {
-        fclose(list);
+        env->closeStream(list);
         return -1;
     }
 
@@ -655,7 +660,7 @@ int FileTypeChecker::check(wchar_t const* listFile, StringList<wchar_t>& include
         results.push_back(result);
         ++count;
     }
-    pclose(pipe);
-    fclose(list);
+    fscanner::Env::Current()->closePipe(pipe);
+    env->closeStream(list);
     return count;
 }

@@ -7,6 +7,7 @@
 
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
+#include "fscanner/fscommon/env.h"
 
 std::list<std::string> MountTableManager::remoteFileSystems;
 
@@ -114,7 +115,9 @@ bool MountTableManager::getMountEntryList(std::vector<MountEntry>& list) {
     log->traceMAX(__LINE__, __FILE__, __func__,
                   "MountTableManager::getMountEntryList - MOUNTED_GETMNTENT1 defined!\n");
     bool retValue = false;
-    FILE* table = setmntent(getMountTablePath(), "r");
+    // The table is opened through the Env and only parsed by getmntent.
+    fscanner::Env* env = fscanner::Env::Current();
+    FILE* table = env->openStream(getMountTablePath(), "r");
     if (table) {
         retValue = true;
         struct mntent* row;
@@ -127,7 +130,7 @@ bool MountTableManager::getMountEntryList(std::vector<MountEntry>& list) {
             entry.setRemote(isRemoteFileSystem(entry.getDevName(), entry.getFileSystemType()));
             list.push_back(entry);
         }
-        if (endmntent(table) != 1) retValue = false;
+        env->closeStream(table);
     }
     log->traceMAX(__LINE__, __FILE__, __func__,
                   "MountTableManager::getMountEntryList - mountEntryList size is %d!\n",

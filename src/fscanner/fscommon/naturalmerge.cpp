@@ -13,6 +13,7 @@
 
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/sysfactory.h"
 #include "fscanner/fscommon/sysfile.h"
 #include "fscanner/fscommon/utils.h"
@@ -71,21 +72,23 @@ public:
     // As LinuxMmFile::create: the name is unlinked and made anew (0660).
     bool create() override {
         if (path.empty() || fd != -1) return false;
-        ::unlink(path.c_str());
-        int d = ::open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0660);
+        fscanner::Env* env = fscanner::Env::Current();
+        env->removeFile(path.c_str());
+        int d = env->openFile(path.c_str(), O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0660);
         if (d == -1) return false;
         reset(d, 0);
         return true;
     }
     bool open() override {
         if (path.empty() || fd != -1) return false;
-        int d = ::open(path.c_str(), O_RDWR | O_CLOEXEC);
+        fscanner::Env* env = fscanner::Env::Current();
+        int d = env->openFile(path.c_str(), O_RDWR | O_CLOEXEC);
         if (d == -1) return false;
         struct stat st;
         // Sizes are 32-bit words, as for every file of this interface.
-        if (::fstat(d, &st) != 0 || st.st_size < 0 ||
+        if (env->fileStatus(d, &st) != 0 || st.st_size < 0 ||
             static_cast<unsigned long long>(st.st_size) > 0xFFFFFFFFull) {
-            ::close(d);
+            env->closeFile(d);
             return false;
         }
         reset(d, static_cast<uint64_t>(st.st_size));
@@ -94,7 +97,7 @@ public:
     bool close() override {
         if (fd == -1) return false;
         bool ok = flush();
-        if (::close(fd) != 0) ok = false;
+        if (fscanner::Env::Current()->closeFile(fd) != 0) ok = false;
         fd = -1;
         logical = position = 0;
         window.clear();
@@ -194,7 +197,7 @@ private:
     }
     bool writeAt(uint64_t at, const unsigned char* data, size_t length) {
         while (length > 0) {
-            ssize_t n = ::pwrite(fd, data, length, static_cast<off_t>(at));
+            ssize_t n = fscanner::Env::Current()->writeFileAt(fd, data, length, static_cast<off_t>(at));
             if (n < 0 && errno == EINTR) continue;
             if (n <= 0) {
                 failed = true;
@@ -210,7 +213,8 @@ private:
         window.resize(kPiece);
         size_t got = 0;
         while (got < kPiece && at + got < logical) {
-            ssize_t n = ::pread(fd, window.data() + got, kPiece - got, static_cast<off_t>(at + got));
+            ssize_t n = fscanner::Env::Current()->readFileAt(fd, window.data() + got, kPiece - got,
+                                                             static_cast<off_t>(at + got));
             if (n < 0 && errno == EINTR) continue;
             if (n <= 0) break;
             got += static_cast<size_t>(n);
@@ -238,7 +242,7 @@ private:
 
 void removeScratch(const wchar_t* name) {
     char* narrow = utils::myWcsToMbsString(name);
-    if (narrow != nullptr) ::unlink(narrow);
+    if (narrow != nullptr) fscanner::Env::Current()->removeFile(narrow);
     delete[] narrow;
 }
 

@@ -13,6 +13,7 @@
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
 #include "fscanner/fscommon/drivehelper.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/stringhelper.h"
 #include "fscanner/fscommon/wildcard.h"
 
@@ -78,7 +79,7 @@ bool resolveNarrow(const char* path, bool followLinks, std::string& resolved) {
         resolved = "/";
     } else {
         char cwd[PATH_BUFFER];
-        if (getcwd(cwd, PATH_BUFFER - 1) == nullptr) return false;
+        if (fscanner::Env::Current()->currentDirectory(cwd, PATH_BUFFER - 1) == nullptr) return false;
         resolved = cwd;
         if (resolved.empty() || resolved[resolved.size() - 1] != '/') resolved += '/';
     }
@@ -99,7 +100,7 @@ bool resolveNarrow(const char* path, bool followLinks, std::string& resolved) {
         if (!followLinks) continue;
 
         char target[PATH_BUFFER];
-        ssize_t length = readlink(resolved.c_str(), target, sizeof(target) - 1);
+        ssize_t length = fscanner::Env::Current()->readLink(resolved.c_str(), target, sizeof(target) - 1);
         if (length < 0) {
             if (errno == EINVAL) continue;  // not a link: the walk goes on
             return false;

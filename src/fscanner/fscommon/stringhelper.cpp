@@ -2,10 +2,12 @@
 // contracts.
 #include "fscanner/fscommon/stringhelper.h"
 
+#include <fcntl.h>
 #include <regex.h>
 #include <sys/types.h>
 
 #include <cctype>
+#include <cerrno>
 #include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
@@ -15,6 +17,7 @@
 
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/pathhelper.h"
 #include "fscanner/fscommon/utils.h"
 
@@ -233,7 +236,8 @@ int renameFile(wchar_t* from, wchar_t* to) {
     char* narrowFrom = narrowName(from);
     char* narrowTo = narrowName(to);
     int result = -1;
-    if (narrowFrom != nullptr && narrowTo != nullptr) result = std::rename(narrowFrom, narrowTo);
+    if (narrowFrom != nullptr && narrowTo != nullptr)
+        result = fscanner::Env::Current()->renameFile(narrowFrom, narrowTo);
     delete[] narrowFrom;
     delete[] narrowTo;
     return result == 0 ? 0 : -1;
@@ -242,12 +246,18 @@ int renameFile(wchar_t* from, wchar_t* to) {
 int removeFile(wchar_t* name) {
     char* narrow = narrowName(name);
     int result = -1;
-    if (narrow != nullptr) result = std::remove(narrow);
+    if (narrow != nullptr) {
+        // remove(3): a file, else an empty directory.
+        fscanner::Env* env = fscanner::Env::Current();
+        result = env->removeFile(narrow);
+        if (result != 0 && errno == EISDIR) result = env->removeDirectory(narrow);
+    }
     delete[] narrow;
     return result == 0 ? 0 : -1;
 }
 
 char* getTempFile_Default(char* prefix) {
+    fscanner::Env* env = fscanner::Env::Current();
     char name[4096];
     for (unsigned long long i = 0;; ++i) {
         if (prefix != nullptr) {
@@ -255,14 +265,12 @@ char* getTempFile_Default(char* prefix) {
         } else {
             std::snprintf(name, sizeof(name), "./kel_%llu", i);
         }
-        FILE* probe = std::fopen(name, "r");
-        if (probe != nullptr) {
-            std::fclose(probe);
-            continue;
-        }
-        FILE* created = std::fopen(name, "w");
-        if (created == nullptr) continue;
-        std::fclose(created);
+        // Created exclusively: a name another process takes at the same
+        // moment fails here and the next number is tried, so no two callers
+        // ever share a file.
+        int fd = env->openFile(name, O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0666);
+        if (fd == -1) continue;
+        env->closeFile(fd);
         size_t length = std::strlen(name);
         char* copy = new char[length + 1];
         std::memcpy(copy, name, length + 1);
@@ -290,13 +298,14 @@ void stopDebug() { debugOn = false; }
 
 void debug(const char* format, ...) {
     if (!debugOn || format == nullptr) return;
-    FILE* file = std::fopen(debugFile, "a");
+    fscanner::Env* env = fscanner::Env::Current();
+    FILE* file = env->openStream(debugFile, "a");
     if (file == nullptr) return;
     va_list args;
     va_start(args, format);
     std::vfprintf(file, format, args);
     va_end(args);
-    std::fclose(file);
+    env->closeStream(file);
 }
 
 namespace {

@@ -8,6 +8,7 @@
 #include <cstring>
 
 #include "base/kelmem.h"
+#include "fscanner/fscommon/env.h"
 
 pthread_mutexattr_t* const DEFAULT_MUTEX_ATTR = nullptr;
 pthread_condattr_t* const DEFAULT_COND_ATTR = nullptr;
@@ -140,31 +141,32 @@ LinuxSharedMutex::LinuxSharedMutex(char const* lockName) : fd(-1), name(nullptr)
     if (name == nullptr) return;
     std::memcpy(name, storePath, a);
     std::memcpy(name + a, lockName, b + 1);
-    fd = ::open(name, O_RDWR | O_CREAT, 0600);
+    fd = fscanner::Env::Current()->openFile(name, O_RDWR | O_CREAT, 0600);
 }
 
 LinuxSharedMutex::~LinuxSharedMutex() {
     close();
-    if (name != nullptr) unlink(name);
+    if (name != nullptr) fscanner::Env::Current()->removeFile(name);
     kelm_free(name);
 }
 
 int LinuxSharedMutex::release() {
     if (fd == -1) return -1;
-    return lockf(fd, F_ULOCK, 0);
+    return fscanner::Env::Current()->lockRange(fd, F_ULOCK, 0);
 }
 
 int LinuxSharedMutex::wait() {
     if (fd == -1) return SYNC_FAILED;
-    return lockf(fd, F_LOCK, 0) == 0 ? SYNC_ACQUIRED : SYNC_FAILED;
+    return fscanner::Env::Current()->lockRange(fd, F_LOCK, 0) == 0 ? SYNC_ACQUIRED : SYNC_FAILED;
 }
 
 int LinuxSharedMutex::wait(long timeout) {
     if (fd == -1) return SYNC_FAILED;
     long rounds = timeout / 100;
     if (timeout % 100 > 0) rounds += 1;
+    fscanner::Env* env = fscanner::Env::Current();
     for (long i = 0; i < rounds; ++i) {
-        if (lockf(fd, F_TLOCK, 0) == 0) return SYNC_ACQUIRED;
+        if (env->lockRange(fd, F_TLOCK, 0) == 0) return SYNC_ACQUIRED;
         if (errno != EAGAIN && errno != EACCES) return SYNC_FAILED;
         usleep(100000);
     }
@@ -174,7 +176,7 @@ int LinuxSharedMutex::wait(long timeout) {
 int LinuxSharedMutex::close() {
     if (fd == -1) return -1;
     // The descriptor value stays; only a second close can tell, and it fails.
-    return ::close(fd);
+    return fscanner::Env::Current()->closeFile(fd);
 }
 
 // ---- LinuxMutex ---------------------------------------------------------------

@@ -15,6 +15,9 @@
 #include <cwchar>
 
 #include "base/kelmem.h"
+#include "fscanner/fscommon/env.h"
+
+using fscanner::Env;
 
 namespace {
 
@@ -39,16 +42,16 @@ uint64_t reservedEnd(uint64_t contentEnd, uint64_t allocated) {
     return rounded < allocated ? rounded : allocated;
 }
 
-// The system's reservation: 0 or the error number (posix_fallocate reports
-// it as its result and leaves errno alone).  Where the file system has no
-// fallocate, the C library emulates it by writing a zero into every block of
-// the range, which backs the blocks on ordinary file systems; copy-on-write
-// and compressing file systems can still refuse a later store, and nothing
-// short of writing each byte for real could promise more there.
-int systemReserve(int fd, uint64_t offset, uint64_t length) {
+// The reservation: 0 or the error number (posix_fallocate reports it as its
+// result and leaves errno alone).  Where the file system has no fallocate,
+// the C library emulates it by writing a zero into every block of the range,
+// which backs the blocks on ordinary file systems; copy-on-write and
+// compressing file systems can still refuse a later store, and nothing short
+// of writing each byte for real could promise more there.
+int reserveSpace(char const* name, int fd, uint64_t offset, uint64_t length) {
     int rc;
     do {
-        rc = posix_fallocate(fd, static_cast<off_t>(offset), static_cast<off_t>(length));
+        rc = Env::Current()->reserveSpace(name, fd, static_cast<off_t>(offset), static_cast<off_t>(length));
     } while (rc == EINTR);
     return rc;
 }
@@ -69,7 +72,7 @@ bool rangeIsAllocated(int fd, uint64_t from, uint64_t to) {
         map->fm_start = covered;
         map->fm_length = to - covered;
         map->fm_extent_count = kExtents;
-        if (ioctl(fd, FS_IOC_FIEMAP, map) != 0 || map->fm_mapped_extents == 0) return false;
+        if (Env::Current()->deviceControl(fd, FS_IOC_FIEMAP, map) != 0 || map->fm_mapped_extents == 0) return false;
         uint64_t before = covered;
         for (unsigned int i = 0; i < map->fm_mapped_extents && covered < to; ++i) {
             const struct fiemap_extent& extent = map->fm_extents[i];
@@ -83,8 +86,6 @@ bool rangeIsAllocated(int fd, uint64_t from, uint64_t to) {
 }
 
 }  // namespace
-
-int (*LinuxMmFile::reserveHook)(char const* name, int fd, uint64_t offset, uint64_t length) = nullptr;
 
 // ---- StdFile ------------------------------------------------------------------
 
@@ -106,8 +107,9 @@ bool StdFile::openMode(const char* mode) {
     if (name == nullptr) return false;
     char narrow[4096];
     if (!narrowName(name, narrow)) return false;
-    if (stream != nullptr) fclose(stream);  // reopening must not leak the old stream
-    stream = fopen(narrow, mode);
+    Env* env = Env::Current();
+    if (stream != nullptr) env->closeStream(stream);  // reopening must not leak the old stream
+    stream = env->openStream(narrow, mode);
     return stream != nullptr;
 }
 
@@ -120,7 +122,7 @@ bool StdFile::close() {
     // fclose writes what is still buffered: a full disk shows here, and the
     // file is then shorter than what write() accepted.  The stream is gone
     // either way.
-    bool flushed = fclose(stream) == 0;
+    bool flushed = Env::Current()->closeStream(stream) == 0;
     stream = nullptr;
     return flushed;
 }
@@ -166,7 +168,8 @@ bool StdFile::size(unsigned int* result) {
 // ---- LinuxMmFile ----------------------------------------------------------------
 
 LinuxMmFile::LinuxMmFile(char const* fileName)
-    : fd(-1), logical(0), allocated(0), position(0), address(kUnmapped), eofFlag(0), name(nullptr) {
+    : fd(-1), logical(0), allocated(0), position(0), address(kUnmapped), eofFlag(0), name(nullptr),
+      written(false) {
     if (fileName != nullptr) name = i_strdup(fileName);
 }
 
@@ -177,27 +180,31 @@ LinuxMmFile::~LinuxMmFile() {
 
 bool LinuxMmFile::create() {
     if (name == nullptr || fd != -1) return false;
-    unlink(name);
-    int d = ::open(name, O_RDWR | O_CREAT | O_TRUNC | O_NONBLOCK, 0660);
+    Env* env = Env::Current();
+    env->removeFile(name);
+    int d = env->openFile(name, O_RDWR | O_CREAT | O_TRUNC | O_NONBLOCK, 0660);
     if (d == -1) return false;
     fd = d;
     logical = 0;
     allocated = 0;
     position = 0;
     eofFlag = 0;
+    written = false;
     return true;
 }
 
 bool LinuxMmFile::open() {
     if (name == nullptr || fd != -1) return false;
-    int d = ::open(name, O_RDWR | O_NONBLOCK, 0660);
+    Env* env = Env::Current();
+    int d = env->openFile(name, O_RDWR | O_NONBLOCK, 0660);
     if (d == -1) return false;
     fd = d;
+    written = false;
     unsigned int onDisk = 0;
     if (!size(&onDisk)) {
         // Not one of ours (too long to describe): left as it is, not cut to
         // a logical size of 0 by a later close.
-        ::close(fd);
+        env->closeFile(fd);
         fd = -1;
         return false;
     }
@@ -210,10 +217,10 @@ bool LinuxMmFile::open() {
     // written without reservation), which a store through the mapping would
     // have to fill.  They are backed now or the file is not opened.
     struct stat st;
-    if (fstat(fd, &st) == 0 && static_cast<unsigned long long>(st.st_blocks) * 512 < onDisk &&
+    if (env->fileStatus(fd, &st) == 0 && static_cast<unsigned long long>(st.st_blocks) * 512 < onDisk &&
         !reserveRange(0, onDisk)) {
         int error = errno;
-        ::close(fd);
+        env->closeFile(fd);
         fd = -1;
         logical = 0;
         allocated = 0;
@@ -226,7 +233,7 @@ bool LinuxMmFile::open() {
 bool LinuxMmFile::size(unsigned int* result) {
     if (fd == -1 || name == nullptr) return false;
     struct stat st;
-    if (stat(name, &st) != 0) return false;
+    if (Env::Current()->status(name, &st) != 0) return false;
     // A mapped file's sizes are 32-bit words; a longer file is not one of
     // ours and is refused rather than read as its size modulo 4 GiB.
     if (st.st_size < 0 || static_cast<unsigned long long>(st.st_size) > 0xFFFFFFFFull) return false;
@@ -277,7 +284,10 @@ unsigned int LinuxMmFile::write(void* buffer, unsigned int length) {
         if (!addChunk(length)) return 0;
     }
     if (address == kUnmapped) return 0;
-    if (length != 0) std::memcpy(address + position, buffer, length);
+    if (length != 0) {
+        std::memcpy(address + position, buffer, length);
+        written = true;
+    }
     position += length;
     return length;
 }
@@ -313,9 +323,13 @@ bool LinuxMmFile::reserve(unsigned int length) {
 
 bool LinuxMmFile::reserveRange(uint64_t from, uint64_t to) {
     if (to <= from) return true;
-    int rc = reserveHook != nullptr ? reserveHook(name, fd, from, to - from) : systemReserve(fd, from, to - from);
+    int rc = reserveSpace(name, fd, from, to - from);
     if ((rc == ENOSPC || rc == EDQUOT) && rangeIsAllocated(fd, from, to)) rc = 0;
-    if (rc == 0) return true;
+    if (rc == 0) {
+        // The file's blocks changed; fallocate may also have moved its end.
+        written = true;
+        return true;
+    }
     errno = rc;
     return false;
 }
@@ -339,11 +353,12 @@ bool LinuxMmFile::grow(unsigned int length, uint64_t contentEnd) {
     // written byte takes a block too), and only then the remapping: a full
     // disk refuses one of the first two and the old mapping stays in use.
     if (!reserveRange(reservedEnd(logical, allocated), reservedEnd(contentEnd, newAllocated))) return false;
-    if (lseek(fd, static_cast<off_t>(newAllocated) - 1, SEEK_SET) == static_cast<off_t>(-1)) return false;
+    Env* env = Env::Current();
     char zero = 0;
-    if (::write(fd, &zero, 1) != 1) return false;
+    written = true;
+    if (env->writeFileAt(fd, &zero, 1, static_cast<off_t>(newAllocated) - 1) != 1) return false;
     unMapFile();
-    fsync(fd);
+    env->syncFile(fd);
     if (!mapFile()) return false;
     allocated = newAllocated;
     return true;
@@ -354,12 +369,13 @@ bool LinuxMmFile::mapFile() {
     if (address != kUnmapped) unMapFile();
     unsigned int onDisk = 0;
     if (!size(&onDisk)) return false;
+    Env* env = Env::Current();
     if (allocated > onDisk) {
-        void* p = mmap(nullptr, allocated, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
+        void* p = env->mapFile(nullptr, allocated, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
         address = (p == MAP_FAILED) ? kUnmapped : static_cast<char*>(p);
     }
     if (address == kUnmapped && onDisk != 0) {
-        void* p = mmap(nullptr, onDisk, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
+        void* p = env->mapFile(nullptr, onDisk, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
         address = (p == MAP_FAILED) ? kUnmapped : static_cast<char*>(p);
     }
     return address != kUnmapped;
@@ -367,25 +383,35 @@ bool LinuxMmFile::mapFile() {
 
 bool LinuxMmFile::unMapFile() {
     if (address == kUnmapped) return false;
-    msync(address, allocated, MS_SYNC);
-    munmap(address, allocated);
+    Env* env = Env::Current();
+    // A file this object has not changed has nothing to flush: syncing it
+    // anyway costs a device flush per file at every read-only close.
+    if (written) env->syncMapping(address, allocated, MS_SYNC);
+    env->unmapFile(address, allocated);
     address = kUnmapped;
-    fsync(fd);
+    if (written) env->syncFile(fd);
     return true;
 }
 
 bool LinuxMmFile::close() {
     if (fd == -1) return false;
+    Env* env = Env::Current();
     unMapFile();
-    if (ftruncate(fd, static_cast<off_t>(logical)) != 0) {
-        // Nothing to report through: the result is the close's.
+    // An unchanged file already has its logical size on disk; truncating it
+    // anyway would dirty its inode and make the next sync of the device pay
+    // for a file nobody wrote.
+    if (written || logical != allocated) {
+        if (env->truncateFile(fd, static_cast<off_t>(logical)) != 0) {
+            // Nothing to report through: the result is the close's.
+        }
     }
-    if (::close(fd) != 0) return false;
+    if (env->closeFile(fd) != 0) return false;
     fd = -1;
     logical = 0;
     allocated = 0;
     position = 0;
     address = kUnmapped;
     eofFlag = 0;
+    written = false;
     return true;
 }

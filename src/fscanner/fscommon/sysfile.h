@@ -116,7 +116,8 @@ public:
     // backed first; when the disk cannot, the open fails, closed again.
     bool open() override;
     // Unmaps, truncates to the logical size, closes.  On a failed close the
-    // object keeps its state and returns false.
+    // object keeps its state and returns false.  A file that was only read
+    // is neither synced nor truncated: it is on disk as it was opened.
     bool close() override;
     // Nothing mapped: 0 and the end flag set.  A read past the logical size
     // copies what remains and sets the flag; a full read clears it.
@@ -147,18 +148,14 @@ public:
     // on disk, else the size on disk.
     bool mapFile();
     // msync + munmap of the allocated size, then fsync; false when unmapped.
+    // The two syncs are left out for a file this object has not changed
+    // since it was opened or created.
     bool unMapFile();
 
     // Observers for callers that need the two sizes (tests, diagnostics).
     uint32_t logicalSize() const { return logical; }
     uint32_t allocatedSize() const { return allocated; }
     bool isOpen() const { return fd != -1; }
-
-    // Test seam: when set, called instead of the system's reservation
-    // (posix_fallocate) with the file's name, its descriptor and the byte
-    // range to back; returns 0 or an error number such as ENOSPC.  Lets a
-    // test fill the disk for some files without a file system to fill.
-    static int (*reserveHook)(char const* name, int fd, uint64_t offset, uint64_t length);
 
 private:
     LinuxMmFile(const LinuxMmFile&) = delete;
@@ -179,6 +176,10 @@ private:
     char* address;  // (char*)-1 when nothing is mapped
     char eofFlag;
     char* name;
+    // Set by the first change to the file (a byte written, space reserved,
+    // growth) since it was opened or created: only such a file is synced
+    // and truncated at close.
+    bool written;
 };
 
 #endif

@@ -1,14 +1,14 @@
 #include "fscanner/fscommon/table.h"
 
-#include <unistd.h>
-
 #include <cerrno>
 #include <cstring>
 #include <cwchar>
 #include <string>
 
 #include "base/kelmem.h"
+#include "fscanner/fscommon/cache_files.h"
 #include "fscanner/fscommon/codec.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/pathhelper.h"
 #include "fscanner/fscommon/sysfactory.h"
 #include "fscanner/fscommon/table_format.h"
@@ -41,7 +41,7 @@ wchar_t* wideJoin(wchar_t const* a, wchar_t const* b, wchar_t const* c = L"") {
 void unlinkWide(wchar_t const* path) {
     if (path == nullptr) return;
     char* narrow = utils::myWcsToMbsString(path);
-    if (narrow != nullptr && narrow[0] != 0) unlink(narrow);
+    if (narrow != nullptr && narrow[0] != 0) fscanner::Env::Current()->removeFile(narrow);
     delete[] narrow;
 }
 
@@ -150,7 +150,7 @@ Index::Index(wchar_t const* idxName, wchar_t const* dir, wchar_t const* fldName)
     if (idxName == nullptr || dir == nullptr || fldName == nullptr) return;
     indexName = wideDup(idxName);
     fieldName = wideDup(fldName);
-    indexFileName = wideJoin(idxName, L".idx");
+    indexFileName = cachefiles::indexFileName(idxName);
     size_t dl = wcslen(dir);
     bool hasSeparator = dl > 0 && dir[dl - 1] == L'/';
     fullPath = wideJoin(dir, hasSeparator ? L"" : L"/", indexFileName != nullptr ? indexFileName : nullptr);
@@ -288,11 +288,11 @@ FS_Table::FS_Table(wchar_t const* tableName, wchar_t const* dir, bool compressed
     directory = wideJoin(real, (rl > 0 && real[rl - 1] == L'/') ? L"" : L"/");
     kelm_free(real);
     name = wideDup(tableName);
-    dataFileName = wideJoin(tableName, kDataSuffix);
+    dataFileName = cachefiles::tableDataName(tableName);
     dataPath = wideJoin(directory, dataFileName);
-    pointerPath = wideJoin(directory, tableName, kPointerSuffix);
-    indexListName = wideJoin(tableName, kIndexListSuffix);
-    wchar_t* lockName = wideJoin(tableName, kLockSuffix);
+    pointerPath = cachefiles::tablePointerPath(directory, tableName);
+    indexListName = cachefiles::tableIndexListName(tableName);
+    wchar_t* lockName = cachefiles::tableLockName(tableName);
     if (directory == nullptr || name == nullptr || dataFileName == nullptr || dataPath == nullptr ||
         pointerPath == nullptr || indexListName == nullptr || lockName == nullptr) {
         kelm_free(lockName);

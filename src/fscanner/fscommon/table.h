@@ -201,13 +201,12 @@ public:
     // not open, or a failure on the way.
     bool compact(int percent);
     // Test seam: when set, called after each record the copy phase of
-    // compact() has stored, with the number of records copied so far.
+    // compact() has stored, with the number of records copied so far.  The
+    // records reach the copy through its mapping, not through a call of the
+    // Env, so a fault-injecting Env cannot stop the copy after a given
+    // record; the later stages each begin with an Env call and are reached
+    // through one.
     static void (*compactCopyHook)(unsigned int copied);
-    // Test seam: when set, called as compact() passes each stage: 1 the
-    // temporary table exists, 2 the copy is done, 3 the indexes are swapped
-    // in, 4 the old data and pointer files are removed, 5 the new ones are in
-    // place.
-    static void (*compactStageHook)(int stage);
 
     static void setBit(unsigned int index, unsigned char* buffer);
     static bool checkBit(unsigned int index, unsigned char const* buffer);

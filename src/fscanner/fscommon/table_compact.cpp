@@ -11,28 +11,12 @@
 
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
+#include "fscanner/fscommon/cache_files.h"
 #include "fscanner/fscommon/stringhelper.h"
 
 void (*FS_Table::compactCopyHook)(unsigned int copied) = nullptr;
-void (*FS_Table::compactStageHook)(int stage) = nullptr;
 
 namespace {
-void passStage(int stage) {
-    if (FS_Table::compactStageHook != nullptr) FS_Table::compactStageHook(stage);
-}
-}  // namespace
-
-namespace {
-
-wchar_t* withSuffix(wchar_t const* text, wchar_t const* suffix) {
-    if (text == nullptr) return nullptr;
-    size_t a = wcslen(text), b = wcslen(suffix);
-    wchar_t* out = static_cast<wchar_t*>(kelm_malloc((a + b + 1) * sizeof(wchar_t)));
-    if (out == nullptr) return nullptr;
-    std::memcpy(out, text, a * sizeof(wchar_t));
-    std::memcpy(out + a, suffix, (b + 1) * sizeof(wchar_t));
-    return out;
-}
 
 // The results of remove and rename are not looked at: what a failure leaves
 // is the state a crash at that point would leave.
@@ -70,7 +54,7 @@ bool FS_Table::compact(int percent) {
     log->traceMID(__LINE__, __FILE__, __FUNCTION__, "FS_Table::compact - performing [%ls] table compact...\n",
                   name);
 
-    wchar_t* tempName = withSuffix(name, L"_cpt");
+    wchar_t* tempName = cachefiles::compactionName(name);
     if (tempName == nullptr) {
         close();
         return false;
@@ -84,7 +68,7 @@ bool FS_Table::compact(int percent) {
     bool ok = temp->create();
     if (ok) {
         for (Index* index : indexes) {
-            wchar_t* tempIndex = withSuffix(index->getIndexName(), L"_cpt");
+            wchar_t* tempIndex = cachefiles::compactionName(index->getIndexName());
             if (tempIndex != nullptr) temp->addHashIndex(tempIndex, index->getFieldName());
             kelm_free(tempIndex);
         }
@@ -101,7 +85,6 @@ bool FS_Table::compact(int percent) {
         return false;
     }
 
-    passStage(1);
     // Copy: numbers become dense in the new table; inserts fill its indexes.
     unsigned int copied = 0;
     unsigned int id = 0;
@@ -123,7 +106,6 @@ bool FS_Table::compact(int percent) {
         more = moveNext(id);
     }
 
-    passStage(2);
     // Swap the indexes in, position by position.
     std::vector<Index*>& fresh = temp->getIndexes();
     for (size_t i = 0; i < indexes.size() && i < fresh.size(); ++i) {
@@ -133,17 +115,14 @@ bool FS_Table::compact(int percent) {
         renameWide(fresh[i]->getIndexFullPathName(), indexes[i]->getIndexFullPathName());
     }
 
-    passStage(3);
     close();
     temp->close();
     temp->eraseHashIndexList(temp->getIndexes());
 
     removeWide(dataPath);
     removeWide(pointerPath);
-    passStage(4);
     renameWide(temp->getDataPath(), dataPath);
     renameWide(temp->getPointerPath(), pointerPath);
-    passStage(5);
 
     delete temp;
     return true;

@@ -74,10 +74,8 @@ const uint32_t kInlineTextBytes = 255;
 
 const uint32_t kIndexListTag = 110;
 
-const wchar_t kDataSuffix[] = L".dat";
-const wchar_t kPointerSuffix[] = L".pxx";
-const wchar_t kIndexListSuffix[] = L"_idx.dat";
-const wchar_t kLockSuffix[] = L"_t_mutex";
+// The files' names (".dat", ".pxx", "_idx.dat", the lock's "_t_mutex") are
+// given in cache_files.h, with every other file of a cache directory.
 
 inline uint32_t bitmapBytes(uint32_t fieldCount) { return (fieldCount + 7) / 8; }
 
