@@ -449,3 +449,34 @@ bool FsFileInfo::compare(FsFileInfo& other, int what, unsigned int op, bool case
             return false;
     }
 }
+
+bool checkPathList(const wchar_t* path, const std::vector<PathInfo>& list, bool caseSensitive,
+                   bool onlyRecursive) {
+    if (path == nullptr || list.empty()) return false;
+    for (size_t i = 0; i < list.size(); ++i) {
+        const wchar_t* entry = list[i].getPathName();
+        if (entry == nullptr) continue;
+        if (onlyRecursive) {
+            if (!list[i].getRecursive()) continue;
+            if (wildvcpathcmp(entry, path, true, caseSensitive)) return true;
+        } else if (wildvcpathcmp(entry, path, list[i].getRecursive(), caseSensitive)) {
+            return true;
+        }
+    }
+    return false;
+}
+
+wchar_t* getPathName(const wchar_t* path, const wchar_t* name) {
+    if (path == nullptr || name == nullptr) return nullptr;
+    size_t pathLength = wcslen(path);
+    size_t nameLength = wcslen(name);
+    bool separator = pathLength > 0 && path[pathLength - 1] != utils::PathSeparator;
+    wchar_t* out = new (std::nothrow) wchar_t[pathLength + (separator ? 1 : 0) + nameLength + 1];
+    if (out == nullptr) return nullptr;
+    wmemcpy(out, path, pathLength);
+    size_t at = pathLength;
+    if (separator) out[at++] = utils::PathSeparator;
+    wmemcpy(out + at, name, nameLength);
+    out[at + nameLength] = 0;
+    return out;
+}

@@ -9,6 +9,7 @@
 #define FSCANNER_FS_FS_FILEINFO_H
 
 #include <cwchar>
+#include <vector>
 
 class FsSerializator;
 
@@ -262,5 +263,21 @@ public:
 private:
     wchar_t* fileSystemName;
 };
+
+// Path-list helpers over the records above.  They sit with the records, not
+// with the pattern matchers of wildcard.h they use, so that the text helpers
+// never need to know a record.
+//
+// True at the first entry that matches path.  With onlyRecursive false an
+// entry matches by wildvcpathcmp(entry, path, entry's recursive flag); with
+// it true non-recursive entries are passed over and the others are tested as
+// recursive.  An empty list, a null path or a nameless entry never matches.
+bool checkPathList(const wchar_t* path, const std::vector<PathInfo>& list, bool caseSensitive,
+                   bool onlyRecursive);
+
+// New new[] string: path, one separator unless path is empty or ends in one,
+// name.  Null if either argument is null or the allocation fails.  The caller
+// releases it with delete[].
+wchar_t* getPathName(const wchar_t* path, const wchar_t* name);
 
 #endif

@@ -22,8 +22,8 @@
 #include "fscanner/fscommon/codec.h"
 #include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/expvalue.h"
-#include "fscanner/fscommon/pathhelper.h"
 #include "fscanner/fscommon/sysfile.h"
+#include "fscanner/fscommon/utils.h"
 #include "fscanner/fscommon/wildcard.h"
 
 namespace {
@@ -404,7 +404,7 @@ uint64_t keyChunk(const KeyText& key, size_t depth) {
         std::memcpy(bytes, key.head + depth, filled);
     }
     if (filled < 8 && key.separator && depth + filled == head) {
-        bytes[filled++] = static_cast<unsigned char>(PathHelper::PathSeparator);
+        bytes[filled++] = static_cast<unsigned char>(utils::PathSeparator);
     }
     size_t at = depth + filled;  // position in the key of bytes[filled]
     if (filled < 8 && at >= tailStart && at - tailStart < key.tailLength) {
@@ -598,8 +598,8 @@ public:
     KeyCollector(unsigned int key, bool caseSensitive)
         : key(key),
           caseSensitive(caseSensitive),
-          lowersSeparatorToItself(std::towlower(static_cast<wint_t>(PathHelper::PathSeparator)) ==
-                                  static_cast<wint_t>(PathHelper::PathSeparator)),
+          lowersSeparatorToItself(std::towlower(static_cast<wint_t>(utils::PathSeparator)) ==
+                                  static_cast<wint_t>(utils::PathSeparator)),
           builder(caseSensitive),
           lastRaw(nullptr),
           lastRawLength(0),
@@ -619,7 +619,7 @@ public:
         const unsigned char* name = file + record.nameOffset();
         KeyText text;
         text.separator = joined && headLength > 0 &&
-                         head[headLength - 1] != static_cast<unsigned char>(PathHelper::PathSeparator);
+                         head[headLength - 1] != static_cast<unsigned char>(utils::PathSeparator);
         if (caseSensitive) {
             // Plain UTF-8 is its own key: the bytes stay in the file.
             text.head = head;
@@ -631,7 +631,7 @@ public:
         } else {
             builder.clear();
             if (!builder.addPlain(head, headLength)) return false;
-            uint32_t separator = static_cast<uint32_t>(PathHelper::PathSeparator);
+            uint32_t separator = static_cast<uint32_t>(utils::PathSeparator);
             if (text.separator && !builder.add(separator)) return false;
             if (!builder.addPlain(name, record.nameLength)) return false;
             store(builder.get(), text);
@@ -1097,7 +1097,7 @@ PassRecord* makePassRecord(unsigned int key, const std::string& raw) {
         // getPathName's separator: a path that is not empty and does not
         // end with one gets one.
         bool separator = joined && stored.pathLength > 0 &&
-                         path[stored.pathLength - 1] != static_cast<unsigned char>(PathHelper::PathSeparator);
+                         path[stored.pathLength - 1] != static_cast<unsigned char>(utils::PathSeparator);
         size_t keyLength = 0;
         if (!missing) {
             keyLength = (byName ? 0 : plainCharacters(path, stored.pathLength)) +
@@ -1110,7 +1110,7 @@ PassRecord* makePassRecord(unsigned int key, const std::string& raw) {
         if (!missing) {
             wchar_t* out = const_cast<wchar_t*>(record->key);
             if (!byName) out = decodePlain(path, stored.pathLength, out);
-            if (separator) *out++ = PathHelper::PathSeparator;
+            if (separator) *out++ = utils::PathSeparator;
             if (byName || joined) out = decodePlain(name, stored.nameLength, out);
             *out = 0;
         }

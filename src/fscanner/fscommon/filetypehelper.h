@@ -23,7 +23,7 @@
 #include <list>
 #include <vector>
 
-#include "fscanner/fscommon/fsbuild.h"
+#include "fscanner/fscommon/strlist.h"
 
 class QvLogWrapper;
 

@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "fscanner/fs/fs_fileinfo.h"
+#include "fscanner/fscommon/utils.h"
 
 class QvLogWrapper;
 
@@ -37,7 +38,7 @@ void insert_sorted(Container& container, const Value& value, Less less) {
 
 class PathHelper {
 public:
-    static constexpr wchar_t PathSeparator = L'/';
+    static constexpr wchar_t PathSeparator = utils::PathSeparator;
 
     // One row of the table of path variables.  The table holds only its end
     // row, named "__LAST_ENTRY__": no variable is defined.

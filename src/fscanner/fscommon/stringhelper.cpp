@@ -18,7 +18,6 @@
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
 #include "fscanner/fscommon/env.h"
-#include "fscanner/fscommon/pathhelper.h"
 #include "fscanner/fscommon/utils.h"
 
 namespace {
@@ -166,7 +165,7 @@ wchar_t* __wcscpy(wchar_t** dst, const wchar_t* src) {
 
 wchar_t* getFullPathName(const wchar_t* dir, const wchar_t* name) {
     if (dir == nullptr || name == nullptr) return nullptr;
-    const wchar_t separator = PathHelper::PathSeparator;
+    const wchar_t separator = utils::PathSeparator;
     size_t dirLength = std::wcslen(dir);
     size_t nameLength = std::wcslen(name);
     bool addSeparator = dirLength == 0 || dir[dirLength - 1] != separator;

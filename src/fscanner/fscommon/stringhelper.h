@@ -11,8 +11,9 @@
 // debug file functions keep process-wide state; call them from one thread at
 // a time.  Everything else is reentrant.
 //
-// The matching helpers (wild*, wcsvccmp, checkPathList) live in wildcard.h and
-// the wide/narrow conversions in utils.h.
+// The matching helpers (wild*, wcsvccmp) live in wildcard.h, checkPathList
+// with the path records in fs_fileinfo.h, and the wide/narrow conversions in
+// utils.h.
 #ifndef FSCANNER_FSCOMMON_STRINGHELPER_H
 #define FSCANNER_FSCOMMON_STRINGHELPER_H
 

@@ -9,7 +9,7 @@
 #include "fscanner/fscommon/cache_files.h"
 #include "fscanner/fscommon/codec.h"
 #include "fscanner/fscommon/env.h"
-#include "fscanner/fscommon/pathhelper.h"
+#include "fscanner/fscommon/resolvepath.h"
 #include "fscanner/fscommon/sysfactory.h"
 #include "fscanner/fscommon/table_format.h"
 #include "fscanner/fscommon/utils.h"
@@ -281,8 +281,7 @@ FS_Table::FS_Table(wchar_t const* tableName, wchar_t const* dir, bool compressed
       mutex(nullptr),
       guard(nullptr) {
     if (tableName == nullptr || dir == nullptr) return;
-    PathHelper helper;
-    wchar_t* real = helper.realPath(dir, false);
+    wchar_t* real = resolvePath(dir, false);
     if (real == nullptr) return;
     size_t rl = wcslen(real);
     directory = wideJoin(real, (rl > 0 && real[rl - 1] == L'/') ? L"" : L"/");

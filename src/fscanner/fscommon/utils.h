@@ -15,6 +15,11 @@ namespace utils {
 
 using ::getTickCount;
 
+// The separator of the library's paths.  It lives here, below everything that
+// builds or splits paths, so that text helpers need not see the path module;
+// PathHelper::PathSeparator is the same character.
+constexpr wchar_t PathSeparator = L'/';
+
 // New new[] block of length * MB_CUR_MAX + 3 bytes, zeroed and filled by
 // wcstombs.  A failed conversion leaves it empty, not null.  Null for null.
 // The caller releases it with delete[].

@@ -1,13 +1,12 @@
 #include "fscanner/fscommon/wildcard.h"
 
-#include "fscanner/fscommon/pathhelper.h"
-
 #include <cwctype>
-#include <new>
+
+#include "fscanner/fscommon/utils.h"
 
 namespace {
 
-const wchar_t kSeparator = PathHelper::PathSeparator;
+const wchar_t kSeparator = utils::PathSeparator;
 
 // The name-mask matcher.  The three steps of the loop are labelled as they
 // are used: read the mask (step 1), compare one character (step 2), advance
@@ -218,35 +217,4 @@ int wcsvccmp(const wchar_t* a, const wchar_t* b, bool caseSensitive) {
 
 int wcsnvccmp(const wchar_t* a, const wchar_t* b, size_t n, bool caseSensitive) {
     return caseSensitive ? wcsncmp(a, b, n) : wcsncasecmp(a, b, n);
-}
-
-bool checkPathList(const wchar_t* path, const std::vector<PathInfo>& list, bool caseSensitive,
-                   bool onlyRecursive) {
-    if (path == nullptr || list.empty()) return false;
-    for (size_t i = 0; i < list.size(); ++i) {
-        const wchar_t* entry = list[i].getPathName();
-        if (entry == nullptr) continue;
-        if (onlyRecursive) {
-            if (!list[i].getRecursive()) continue;
-            if (wildvcpathcmp(entry, path, true, caseSensitive)) return true;
-        } else if (wildvcpathcmp(entry, path, list[i].getRecursive(), caseSensitive)) {
-            return true;
-        }
-    }
-    return false;
-}
-
-wchar_t* getPathName(const wchar_t* path, const wchar_t* name) {
-    if (path == nullptr || name == nullptr) return nullptr;
-    size_t pathLength = wcslen(path);
-    size_t nameLength = wcslen(name);
-    bool separator = pathLength > 0 && path[pathLength - 1] != kSeparator;
-    wchar_t* out = new (std::nothrow) wchar_t[pathLength + (separator ? 1 : 0) + nameLength + 1];
-    if (out == nullptr) return nullptr;
-    wmemcpy(out, path, pathLength);
-    size_t at = pathLength;
-    if (separator) out[at++] = kSeparator;
-    wmemcpy(out + at, name, nameLength);
-    out[at + nameLength] = 0;
-    return out;
 }

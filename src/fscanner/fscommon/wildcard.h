@@ -12,7 +12,6 @@
 #include <type_traits>
 #include <vector>
 
-#include "fscanner/fs/fs_fileinfo.h"
 #include "fscanner/fscommon/utils.h"
 
 namespace utils {
@@ -97,17 +96,5 @@ bool checkWildCard(const wchar_t* text);
 // wcscmp / wcsncmp when caseSensitive, wcscasecmp / wcsncasecmp otherwise.
 int wcsvccmp(const wchar_t* a, const wchar_t* b, bool caseSensitive);
 int wcsnvccmp(const wchar_t* a, const wchar_t* b, size_t n, bool caseSensitive);
-
-// True at the first entry that matches path.  With onlyRecursive false an
-// entry matches by wildvcpathcmp(entry, path, entry's recursive flag); with
-// it true non-recursive entries are passed over and the others are tested as
-// recursive.  An empty list, a null path or a nameless entry never matches.
-bool checkPathList(const wchar_t* path, const std::vector<PathInfo>& list, bool caseSensitive,
-                   bool onlyRecursive);
-
-// New new[] string: path, one separator unless path is empty or ends in one,
-// name.  Null if either argument is null or the allocation fails.  The caller
-// releases it with delete[].
-wchar_t* getPathName(const wchar_t* path, const wchar_t* name);
 
 #endif
