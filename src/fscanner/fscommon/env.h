@@ -105,6 +105,14 @@ public:
     virtual void* findSymbol(void* library, const char* symbol) = 0;
     virtual int unloadLibrary(void* library) = 0;
     virtual const char* libraryError() = 0;
+
+    // -------------------------------------------------------- directories
+    // getdents64(2): fills buffer with the next records (struct dirent64
+    // layout: 64-bit inode, 64-bit offset, 16-bit record length, type byte,
+    // name) of the directory open on fd.  Bytes filled, 0 at the end, -1
+    // with errno.  Reads a directory without the status and flag calls
+    // fdopendir(3) makes.
+    virtual ssize_t readDirectoryEntries(int fd, void* buffer, size_t size) = 0;
 };
 
 // Forwards every call to a target Env (not owned).  Subclass it and
@@ -192,6 +200,9 @@ public:
     }
     int unloadLibrary(void* library) override { return target_->unloadLibrary(library); }
     const char* libraryError() override { return target_->libraryError(); }
+    ssize_t readDirectoryEntries(int fd, void* buffer, size_t size) override {
+        return target_->readDirectoryEntries(fd, buffer, size);
+    }
 
 private:
     Env* target_;

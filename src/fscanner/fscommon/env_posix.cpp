@@ -4,6 +4,7 @@
 #include <limits.h>
 #include <sys/file.h>
 #include <sys/mman.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -73,6 +74,9 @@ public:
     void* findSymbol(void* library, const char* symbol) override { return ::dlsym(library, symbol); }
     int unloadLibrary(void* library) override { return ::dlclose(library); }
     const char* libraryError() override { return ::dlerror(); }
+    ssize_t readDirectoryEntries(int fd, void* buffer, size_t size) override {
+        return ::syscall(SYS_getdents64, fd, buffer, size);
+    }
 };
 
 std::atomic<Env*> installed{nullptr};
