@@ -271,7 +271,9 @@ int DirectoryWalker::walkDirectory(PathDrive& path, int timeoutMs, int64_t tag, 
     sink_.enterDirectory(directory);
 
     // Read whole and closed before the first entry is visited: no
-    // descriptor stays open while the recursion goes down.
+    // descriptor stays open while the recursion goes down.  The sink hears
+    // of the listing before any entry's status is taken, as it did when the
+    // status calls were made entry by entry.
     Env* env = Env::Current();
     int readError = 0;
     int count = -1;
@@ -282,9 +284,10 @@ int DirectoryWalker::walkDirectory(PathDrive& path, int timeoutMs, int64_t tag, 
                                level.narrow.c_str(), static_cast<unsigned int>(readError), strerror(readError));
     } else {
         count = readEntries(fd, level, &readError);
-        if (count > 0) statusPass(fd, level, directory, ownStatus);
-        errno = 0;
-        if (env->closeFile(fd) != 0 || count == 0) {
+        if (count == 0) {
+            // Not even "." and "..": a directory removed after it was opened.
+            errno = 0;
+            env->closeFile(fd);
             if (readError == 0) readError = errno;
             count = -1;
         }
@@ -298,6 +301,18 @@ int DirectoryWalker::walkDirectory(PathDrive& path, int timeoutMs, int64_t tag, 
     directory.listed = true;
     sink_.directoryListed(directory);
     unsigned int start = getTickCount();
+
+    statusPass(fd, level, directory, ownStatus);
+    errno = 0;
+    if (env->closeFile(fd) != 0) {
+        // A directory whose descriptor cannot be closed is given up as one
+        // that could not be read.
+        directory.listed = false;
+        directory.readError = readError != 0 ? readError : errno;
+        sink_.skipDirectory(directory, WalkSkip::Unreadable, directory.readError);
+        sink_.leaveDirectory(directory, FS_SCAN_DONE);
+        return FS_SCAN_DONE;
+    }
 
     const bool recursive = path.getRecursive();
     int result = FS_SCAN_DONE;

@@ -6,12 +6,12 @@
 //   1. the budget: below 1 ms left, skipDirectory(TimedOut) and result 2;
 //   2. the path: past 4095 characters, or without a multibyte form in the
 //      caller's conversion buffer, skipDirectory and result 0;
-//   3. enterDirectory, then the directory is read whole through a descriptor
-//      and every entry that will be visited gets its status by fstatat on
-//      that descriptor (never following a link); the descriptor is closed
-//      before the first entry is visited, so none stays open during the
-//      recursion.  An unreadable directory: skipDirectory(Unreadable),
-//      leaveDirectory, result 0;
+//   3. enterDirectory; the directory is read whole through a descriptor;
+//      directoryListed; every entry that will be visited gets its status by
+//      fstatat on that descriptor (never following a link); the descriptor
+//      is closed before the first entry is visited, so none stays open
+//      during the recursion.  An unreadable directory: skipDirectory
+//      (Unreadable), leaveDirectory, result 0;
 //   4. the entries from the last read to the first: skipEntry for those
 //      passed over before their status (why: Undecodable, and with the
 //      options below Dot, PathTooLong, Excluded), visitEntry for the rest,
