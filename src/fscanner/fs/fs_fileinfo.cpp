@@ -8,6 +8,7 @@
 
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/expvalue.h"
 #include "fscanner/fscommon/utils.h"
 #include "fscanner/fscommon/wildcard.h"
@@ -252,7 +253,7 @@ bool FsFileInfo::updateInfo() const {
     wchar_t* fullPath = getPathName(path, name);
     char* narrow = utils::myWcsToMbsString(fullPath);
     struct stat status;
-    bool ok = narrow != nullptr && narrow[0] != 0 && lstat(narrow, &status) == 0;
+    bool ok = narrow != nullptr && narrow[0] != 0 && fscanner::Env::Current()->linkStatus(narrow, &status) == 0;
     delete[] narrow;
     if (!ok) {
         getQvLogFs()->traceMAX(__LINE__, __FILE__, __FUNCTION__,
@@ -263,7 +264,15 @@ bool FsFileInfo::updateInfo() const {
         return false;
     }
     delete[] fullPath;
+    fillFromStatus(status);
+    return true;
+}
 
+void FsFileInfo::setStatus(const struct stat& status) {
+    fillFromStatus(status);
+}
+
+void FsFileInfo::fillFromStatus(const struct stat& status) const {
     if ((validMask & VALID_ATTR) == 0) attr = attributesOf(status.st_mode);
     if ((validMask & VALID_SIZE) == 0) size = static_cast<unsigned long long>(status.st_size);
     if ((validMask & VALID_DEVICE) == 0) device = static_cast<unsigned int>(status.st_dev);
@@ -275,7 +284,6 @@ bool FsFileInfo::updateInfo() const {
     if ((validMask & VALID_LAST_MODIFY_TIME) == 0) lastModifyTime = static_cast<long>(status.st_mtime);
     if ((validMask & VALID_LINK_COUNT) == 0) linkCount = static_cast<unsigned int>(status.st_nlink);
     validMask |= VALID_STAT_FIELDS;
-    return true;
 }
 
 // ------------------------------------------------------------------ PathInfo

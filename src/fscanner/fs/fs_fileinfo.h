@@ -12,6 +12,7 @@
 #include <vector>
 
 class FsSerializator;
+struct stat;
 
 // Kinds of drive.  Every value is a single bit so that a set of kinds is a
 // plain mask (see the drive group masks below).
@@ -130,6 +131,13 @@ public:
     // false; the next lazy getter tries again.
     bool updateInfo() const;
 
+    // Fills every field of the ten lstat bits that is still clear from
+    // status, as a successful updateInfo does from its own call.
+    // For a caller that already holds the entry's status (a walk's fstatat
+    // on the directory's descriptor).  status has the large-file layout the
+    // library is built with (_FILE_OFFSET_BITS=64 on 32-bit targets).
+    void setStatus(const struct stat& status);
+
     // Compares this record (left) with other (right) through
     // checkSimpleExpression; what: 1 path, 2 name, 3 full path, 4 size (raw,
     // no lazy fill).  Any other what gives false.
@@ -148,6 +156,7 @@ public:
 private:
     void releaseStrings();
     void copyFrom(const FsFileInfo& other);
+    void fillFromStatus(const struct stat& status) const;
 
     wchar_t* path;
     wchar_t* name;

@@ -209,7 +209,8 @@ public:
               std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
               int timeoutMs);
     // Walks path and writes its rows below parentId; 0, or 2 when the budget
-    // ran out.
+    // ran out.  One DirectoryWalker (walk.h) reads the tree; this object's
+    // sink writes the rows and counts.
     int scan(FsQuery const& query, PathDrive& path, RecordSet& directories,
              unsigned int& directoriesIndex, RecordSet& files, int parentId,
              std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
@@ -252,8 +253,12 @@ public:
     bool cacheUnusable;
     bool tableFlag;
     bool cacheChecker;
+    // Where the scan converts directory paths (grown, never shrunk; its size
+    // decides which long multibyte paths still convert).
     char* narrowPathBuffer;
     size_t narrowPathBufferSize;
+    // No longer used by the scan, which decodes names into its walker; kept
+    // so that the object's layout stays as it was.
     wchar_t* wideNameBuffer;
     size_t wideNameBufferSize;
     // Directory id -> component and parent id, of the ids walked last.

@@ -117,6 +117,14 @@ public:
     // tmpnam(3): proposes a name that no file has yet, creating nothing;
     // null when there is none.
     virtual char* tempName(char* buffer) = 0;
+
+    // -------------------------------------------------------- directories
+    // getdents64(2): fills buffer with the next records (struct dirent64
+    // layout: 64-bit inode, 64-bit offset, 16-bit record length, type byte,
+    // name) of the directory open on fd.  Bytes filled, 0 at the end, -1
+    // with errno.  Reads a directory without the status and flag calls
+    // fdopendir(3) makes.
+    virtual ssize_t readDirectoryEntries(int fd, void* buffer, size_t size) = 0;
 };
 
 // Reads the whole of path (opened read-only) into *content, replacing what
@@ -222,6 +230,10 @@ public:
     }
     int removeDirectory(const char* path) override { return target_->removeDirectory(path); }
     char* tempName(char* buffer) override { return target_->tempName(buffer); }
+
+    ssize_t readDirectoryEntries(int fd, void* buffer, size_t size) override {
+        return target_->readDirectoryEntries(fd, buffer, size);
+    }
 
 private:
     Env* target_;

@@ -13,8 +13,10 @@
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
 #include "fscanner/fscommon/checksum.h"
+#include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/pathhelper.h"
 #include "fscanner/fscommon/utils.h"
+#include "fscanner/fscommon/walk.h"
 #include "fscanner/fscommon/wildcard.h"
 
 // The walk reads directories and file status with large-file support: without
@@ -25,113 +27,189 @@ static_assert(sizeof(off_t) == 8 && sizeof(ino_t) == 8, "the library is built wi
 
 namespace {
 
-// Longest path the walk accepts, in wide characters.
-const size_t kMaxPath = 4095;
-// Narrow buffer of the checksum paths, in bytes.
-const size_t kNarrowPathBytes = 4096;
+using fscanner::DirectoryWalker;
+using fscanner::WalkDirectory;
+using fscanner::WalkEntry;
+using fscanner::WalkSkip;
+using fscanner::WalkVisit;
 
-// Process-wide state of the walk.  Never released but at exit; one walk at a
-// time (see the header).
+// Process-wide state of the direct walk.  Never released but at exit; one
+// walk at a time (see the header).  The conversion block's size carries from
+// walk to walk: it decides whether a path whose multibyte form is longer than
+// 3 bytes per character still converts.
 char* narrowPath = nullptr;      // directory being opened
 size_t narrowPathCapacity = 0;   // bytes
-wchar_t* wideName = nullptr;     // entry name being converted
-size_t wideNameCapacity = 0;     // characters
-StringList<char>* dfsLocalList = nullptr;
-bool dfsLocalListLoaded = false;
-bool dfsLocalListPending = true;  // the list has not been tried yet
+fscanner::DfsLocalList dfsLocalList;
 
-// Makes the narrow buffer hold at least bytes; a new buffer is zeroed.  The
-// buffer never shrinks.
-bool reserveNarrow(size_t bytes) {
-    if (narrowPathCapacity >= bytes) return true;
-    char* fresh = static_cast<char*>(kelm_malloc(bytes));
-    if (fresh == nullptr) return false;
-    std::memset(fresh, 0, bytes);
-    kelm_free(narrowPath);
-    narrowPath = fresh;
-    narrowPathCapacity = bytes;
-    return true;
-}
+const fscanner::DfsTraceStyle kDfsTraces = {"::fs_scan - ", "FS_Cache::scan - ", "\n", "dfsAddRecord"};
 
-bool reserveWide(size_t characters) {
-    if (wideNameCapacity >= characters) return true;
-    wchar_t* fresh = static_cast<wchar_t*>(kelm_malloc(characters * sizeof(wchar_t)));
-    if (fresh == nullptr) return false;
-    wmemset(fresh, 0, characters);
-    kelm_free(wideName);
-    wideName = fresh;
-    wideNameCapacity = characters;
-    return true;
-}
+// The direct walk's receiver: offers every file of an included, not excluded
+// directory to the criteria stage and writes the hits.  Excludes act on every
+// entry before its status; "." and ".." and names past the path limit are
+// passed over before it too.
+class DirectScanSink : public fscanner::WalkSink {
+public:
+    DirectScanSink(FsResultSetWriter& writer, FileProcessor& processor, std::vector<PathInfo>& includes,
+                   std::vector<PathInfo>& excludes, bool caseSensitive, FsQueryStatistics* statistics)
+        : writer_(writer),
+          processor_(processor),
+          includes_(includes),
+          excludes_(excludes),
+          caseSensitive_(caseSensitive),
+          statistics_(statistics),
+          log_(getQvLogFs()) {}
 
-// Narrow full path of a file for the checksum pass: path and name each through
-// wcstombs, within kNarrowPathBytes.  False when either does not convert or
-// the result does not fit.
-bool narrowFullPath(const wchar_t* path, const wchar_t* name, char* out) {
-    if (path == nullptr || name == nullptr) return false;
-    size_t used = wcstombs(out, path, kNarrowPathBytes);
-    if (used == static_cast<size_t>(-1) || used >= kNarrowPathBytes) return false;
-    size_t more = wcstombs(out + used, name, kNarrowPathBytes - used);
-    if (more == static_cast<size_t>(-1) || used + more >= kNarrowPathBytes) return false;
-    return true;
-}
-
-// Why the status of directory/name cannot be read, for the statistics: the
-// status call is made again, as the first one's errno may be gone.  0 when it
-// now succeeds.
-int statusError(const std::string& directory, const char* name) {
-    std::string path = directory;
-    if (path.empty() || path.back() != '/') path += '/';
-    path += name;
-    struct stat status;
-    return lstat(path.c_str(), &status) == 0 ? 0 : errno;
-}
-
-// Decides, for one directory of a "dfs" tree, whether its files are recorded.
-bool dfsAddRecord(QvLogWrapper* log, const char* narrow, DriveType driveType) {
-    log->traceMAX(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - get a path on 'dfs' filesystem\n");
-    FileSystemHelper helper;
-    char* fset = helper.dfs_mount(narrow);
-    log->traceMAX(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - fset value for '%s' path is %s\n",
-                  narrow, fset != nullptr ? fset : "NULL");
-    bool isLocal = true;
-    if (fset != nullptr) {
-        if (dfsLocalList == nullptr) dfsLocalList = new StringList<char>();
-        if (dfsLocalListPending) {
-            dfsLocalListLoaded = helper.load_dfs_local(helper.dfs_hname(), *dfsLocalList) == 0;
-            if (dfsLocalListLoaded) {
-                log->traceMAX(__LINE__, __FILE__, __FUNCTION__,
-                              "FS_Cache::scan - load_dfs_local_retValue value is true: dfs local list loaded!\n");
-            } else {
-                log->traceMAX(__LINE__, __FILE__, __FUNCTION__,
-                              "FS_Cache::scan - load_dfs_local_retValue value is false: dfs local list not loaded!\n");
-            }
-            dfsLocalListPending = false;
-        }
-        // Without the list every file set is asked about on its own; with it,
-        // only a file set found in the list is asked.
-        if (!dfsLocalListLoaded) {
-            isLocal = helper.dfs_local(fset, helper.dfs_hname()) != 0;
-        } else {
-            if (dfsLocalList->find(fset) >= 0) {
-                isLocal = helper.dfs_local(fset, helper.dfs_hname()) != 0;
-                log->traceMAX(__LINE__, __FILE__, __FUNCTION__,
-                              "::fs_scan - '%s' found in dfs local list\n", fset);
-            } else {
-                log->traceMAX(__LINE__, __FILE__, __FUNCTION__,
-                              "::fs_scan - '%s' not found in dfs local list\n", fset);
-                isLocal = false;
-            }
+    void skipDirectory(const WalkDirectory& directory, WalkSkip why, int error) override {
+        const wchar_t* path = directory.pathName;
+        switch (why) {
+            case WalkSkip::TimedOut:
+                log_->traceMID(__LINE__, __FILE__, "fs_scan", "::fs_scan - fs scanning timed out (timeout)\n");
+                break;
+            case WalkSkip::PathTooLong:
+                log_->traceMID(__LINE__, __FILE__, "fs_scan", "::fs_scan - '%S' path too long\n", path);
+                if (statistics_ != nullptr) statistics_->addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, path, 0);
+                break;
+            case WalkSkip::NotConvertible:
+            case WalkSkip::ConvertedTooLong:
+                log_->traceMID(__LINE__, __FILE__, "fs_scan", "::fs_scan - '%S' path can't be converted\n", path);
+                if (statistics_ != nullptr) {
+                    statistics_->addSkipped(why == WalkSkip::NotConvertible ? FsQueryStatistics::SKIP_UNDECODABLE_NAME
+                                                                            : FsQueryStatistics::SKIP_PATH_TOO_LONG,
+                                            path, 0);
+                }
+                break;
+            case WalkSkip::Unreadable:
+                log_->traceMID(__LINE__, __FILE__, "fs_scan", "::fs_scan - scandir error opening '%s' path!\n",
+                               directory.narrowPath->c_str());
+                if (statistics_ != nullptr) {
+                    statistics_->addSkipped(FsQueryStatistics::SKIP_UNREADABLE_DIRECTORY,
+                                            directory.narrowPath->c_str(), nullptr, error);
+                }
+                break;
+            default:  // OutOfMemory: given up without a word
+                break;
         }
     }
-    log->traceMAX(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - isLocal value for '%s' path is %s\n",
-                  narrow, isLocal ? "true" : "false");
-    bool remote = driveType == dtRemote;
-    bool addRecord = (!remote && isLocal) || (remote && !isLocal);
-    log->traceMAX(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - bAddRecord value for '%s' path is %s\n",
-                  narrow, addRecord ? "true" : "false");
-    return addRecord;
-}
+
+    void enterDirectory(const WalkDirectory& directory) override {
+        Level& level = levelOf(directory);
+        level.checksums = FileChecksumInfo();  // valid false, flags 0
+        level.onDfs = false;
+        level.dfsAdd = false;
+        const wchar_t* fileSystem = directory.path->getDriveFileSystem();
+        if (fileSystem != nullptr && wcscmp(fileSystem, L"dfs") == 0) {
+            level.onDfs = true;
+            level.dfsAdd = fscanner::dfsDecision(log_, kDfsTraces, dfsLocalList, directory.narrowPath->c_str(),
+                                                 directory.path->getDriveType());
+        }
+    }
+
+    void directoryListed(const WalkDirectory& directory) override {
+        Level& level = levelOf(directory);
+        if (statistics_ != nullptr && directory.readError != 0) {
+            statistics_->addSkipped(FsQueryStatistics::SKIP_UNREADABLE_DIRECTORY, directory.narrowPath->c_str(),
+                                    nullptr, directory.readError);
+        }
+        // Made once per directory, on the path as given; they govern files only.
+        level.included = includes_.empty() || checkPathList(directory.pathName, includes_, caseSensitive_, false);
+        level.excluded = !excludes_.empty() && checkPathList(directory.pathName, excludes_, caseSensitive_, false);
+    }
+
+    void skipEntry(const WalkDirectory& directory, const WalkEntry& entry, WalkSkip why) override {
+        if (why == WalkSkip::Undecodable) {
+            log_->traceMID(__LINE__, __FILE__, "fs_scan", "::fs_scan - file name len is 0. file skipped!\n");
+            if (statistics_ != nullptr) {
+                statistics_->addSkipped(FsQueryStatistics::SKIP_UNDECODABLE_NAME, directory.narrowPath->c_str(),
+                                        entry.name, 0);
+            }
+        } else if (why == WalkSkip::PathTooLong && statistics_ != nullptr) {
+            statistics_->addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, directory.narrowPath->c_str(), entry.name,
+                                    0);
+        }
+    }
+
+    WalkVisit visitEntry(const WalkDirectory& directory, const WalkEntry& entry, FsFileInfo& info,
+                         bool known) override {
+        Level& level = levelOf(directory);
+        WalkVisit visit;
+        unsigned int attr = info.getAttr();  // a failed status leaves attr 0: the entry is then a file
+        // An entry without status goes on as a file, and nothing below it is
+        // read: past the system's 4095 bytes, or refused (a directory that
+        // may be listed but not searched), or gone since the listing.
+        if (!known && statistics_ != nullptr) {
+            const std::string& directoryBytes = *directory.narrowPath;
+            if (directoryBytes.size() + 1 + entry.nameBytes > DirectoryWalker::kMaxPath) {
+                statistics_->addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, directoryBytes.c_str(), entry.name, 0);
+            } else {
+                statistics_->addSkipped(FsQueryStatistics::SKIP_NO_STATUS, directoryBytes.c_str(), entry.name,
+                                        fscanner::statusErrorOf(directoryBytes, entry.name));
+            }
+        }
+
+        if (attr & FsFileInfo::ATTR_DIRECTORY) {
+            if ((attr & FsFileInfo::ATTR_SYMLINK) == 0 && directory.path->getRecursive()) {
+                if (!excludes_.empty() && checkPathList(entry.fullPath, excludes_, caseSensitive_, true)) {
+                    log_->traceMID(__LINE__, __FILE__, "fs_scan", "::fs_scan - path '%S' excluded!\n", entry.fullPath);
+                } else {
+                    if (statistics_ != nullptr) statistics_->addDirectory();
+                    visit.descend = true;
+                }
+            }
+            return visit;
+        }
+        if (!level.included || level.excluded) return visit;
+
+        if (statistics_ != nullptr) statistics_->addFile();
+        FileChecksumInfo& checksums = level.checksums;
+        unsigned int wanted = processor_.processingFlags;
+        if (wanted & (FileProcessor::PROCESS_MD5 | FileProcessor::PROCESS_CRC32 | FileProcessor::PROCESS_Q32)) {
+            if (wanted & FileProcessor::PROCESS_CRC32) checksums.flags |= FILE_CHECKSUM_CRC32;
+            if (wanted & FileProcessor::PROCESS_Q32) checksums.flags |= FILE_CHECKSUM_Q32;
+            if (wanted & FileProcessor::PROCESS_MD5) checksums.flags |= FILE_CHECKSUM_MD5;
+            // Only a regular file's content is read.  A link, a pipe or a
+            // device is not opened (a pipe would block, a device may never
+            // end): the sums then still hold what the previous file of this
+            // directory left in them.
+            if ((attr & FsFileInfo::ATTR_REGULAR) != 0) {
+                std::vector<char> narrowFile(fscanner::kNarrowFilePathBytes);
+                if (fscanner::narrowFilePath(info.getPath(), info.getName(), narrowFile.data())) {
+                    computeRegularFileChecksumInfo(checksums, narrowFile.data());
+                }
+            }
+        }
+        if (processor_.satisfyCriteria(info, checksums, nullptr) && (!level.onDfs || level.dfsAdd)) {
+            writer_.addRecord(info);
+            if (statistics_ != nullptr) statistics_->addHit();
+        }
+        return visit;
+    }
+
+    void leaveDirectory(const WalkDirectory&, int) override {}
+
+private:
+    // What one directory of the walk keeps while its entries are visited.
+    struct Level {
+        bool included = false;
+        bool excluded = false;
+        bool onDfs = false;
+        bool dfsAdd = false;
+        FileChecksumInfo checksums;  // one per visit, carried from file to file
+    };
+    Level& levelOf(const WalkDirectory& directory) {
+        size_t depth = static_cast<size_t>(directory.depth);
+        if (levels_.size() <= depth) levels_.resize(depth + 1);
+        return levels_[depth];
+    }
+
+    FsResultSetWriter& writer_;
+    FileProcessor& processor_;
+    std::vector<PathInfo>& includes_;
+    std::vector<PathInfo>& excludes_;
+    bool caseSensitive_;
+    FsQueryStatistics* statistics_;
+    QvLogWrapper* log_;
+    std::vector<Level> levels_;
+};
 
 }  // namespace
 
@@ -171,7 +249,7 @@ bool fs_isValidPath(wchar_t* path) {
         return false;
     }
     struct stat status;
-    if (lstat(narrow, &status) != 0) {
+    if (fscanner::Env::Current()->linkStatus(narrow, &status) != 0) {
         unsigned int error = static_cast<unsigned int>(errno);
         log->traceMIN(__LINE__, __FILE__, __FUNCTION__,
                       "fs_isValidPath - lstat error opening '%S' path, errno: %u", path, error);
@@ -191,7 +269,8 @@ int fs_readDirectory(const char* path, dirent*** namelist, int* error) {
     *error = 0;
     if (path == nullptr || namelist == nullptr) return -1;
     *namelist = nullptr;
-    DIR* dir = opendir(path);
+    fscanner::Env* env = fscanner::Env::Current();
+    DIR* dir = env->openDirectory(path);
     if (dir == nullptr) {
         *error = errno;
         log->traceMIN(__LINE__, __FILE__, "scandir", "::scandir CAN'T OPEN %s dir, errno: %u ('%s')",
@@ -202,7 +281,7 @@ int fs_readDirectory(const char* path, dirent*** namelist, int* error) {
     for (;;) {
         // readdir gives null at the end and on an error; only errno tells.
         errno = 0;
-        struct dirent* entry = readdir(dir);
+        struct dirent* entry = env->readDirectory(dir);
         if (entry == nullptr) {
             *error = errno;
             break;
@@ -213,7 +292,7 @@ int fs_readDirectory(const char* path, dirent*** namelist, int* error) {
             log->traceMAX(__LINE__, __FILE__, "scandir", "::scandir - *namelist == NULL!\n");
             // The entries read so far stay in *namelist; the handle is closed
             // so that a failing walk does not also leak descriptors.
-            closedir(dir);
+            env->closeDirectory(dir);
             *error = ENOMEM;
             return -1;
         }
@@ -221,7 +300,7 @@ int fs_readDirectory(const char* path, dirent*** namelist, int* error) {
         dirent* copy = static_cast<dirent*>(kelm_malloc(entry->d_reclen));
         if (copy == nullptr) {
             log->traceMAX(__LINE__, __FILE__, "scandir", "::scandir - (*namelist)[i] == NULL!\n");
-            closedir(dir);
+            env->closeDirectory(dir);
             *error = ENOMEM;
             return -1;
         }
@@ -230,7 +309,7 @@ int fs_readDirectory(const char* path, dirent*** namelist, int* error) {
         ++count;
     }
     errno = 0;
-    if (closedir(dir) != 0 || count == 0) {
+    if (env->closeDirectory(dir) != 0 || count == 0) {
         if (*error == 0) *error = errno;
         for (int i = 0; i < count; ++i) kelm_free((*namelist)[i]);
         kelm_free(*namelist);
@@ -273,194 +352,13 @@ int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& path
 int fs_scan(FsResultSetWriter& writer, FileProcessor& processor, PathDrive& pathDrive,
             std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes, bool caseSensitive,
             int timeoutMs, FsQueryStatistics* statistics) {
-    QvLogWrapper* log = getQvLogFs();
-    PathInfo pathInfo(pathDrive);
-    FileChecksumInfo checksums;
-    checksums.valid = false;
-    checksums.flags = 0;
-
-    if (timeoutMs < 1) {
-        log->traceMID(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - fs scanning timed out (timeout)\n");
-        return FS_SCAN_TIMED_OUT;
-    }
-    const wchar_t* path = pathInfo.getPathName();
-    if (path == nullptr) return FS_SCAN_DONE;
-    size_t pathLength = wcslen(path);
-    if (pathLength > kMaxPath) {
-        log->traceMID(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - '%S' path too long\n", path);
-        if (statistics != nullptr) statistics->addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, path, 0);
-        return FS_SCAN_DONE;
-    }
-
-    // The factor 3 bytes per character is fixed; a path whose multibyte form
-    // is longer does not fit and is given up like an unreadable directory.
-    if (!reserveNarrow(pathLength * 3 + 1)) return FS_SCAN_DONE;
-    size_t converted = wcstombs(narrowPath, path, narrowPathCapacity);
-    if (converted == static_cast<size_t>(-1) || converted >= narrowPathCapacity) {
-        log->traceMID(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - '%S' path can't be converted\n", path);
-        if (statistics != nullptr) {
-            statistics->addSkipped(converted == static_cast<size_t>(-1) ? FsQueryStatistics::SKIP_UNDECODABLE_NAME
-                                                                       : FsQueryStatistics::SKIP_PATH_TOO_LONG,
-                                   path, 0);
-        }
-        return FS_SCAN_DONE;
-    }
-
-    bool onDfs = false;
-    bool dfsAdd = false;
-    const wchar_t* fileSystem = pathDrive.getDriveFileSystem();
-    if (fileSystem != nullptr && wcscmp(fileSystem, L"dfs") == 0) {
-        onDfs = true;
-        dfsAdd = dfsAddRecord(log, narrowPath, pathDrive.getDriveType());
-    }
-
-    size_t includeCount = includes.size();
-    size_t excludeCount = excludes.size();
-    dirent** entries = nullptr;
-    int readError = 0;
-    int entryCount = fs_readDirectory(narrowPath, &entries, &readError);
-    if (entryCount < 0) {
-        log->traceMID(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - scandir error opening '%s' path!\n",
-                      narrowPath);
-        if (statistics != nullptr) {
-            statistics->addSkipped(FsQueryStatistics::SKIP_UNREADABLE_DIRECTORY, narrowPath, nullptr, readError);
-        }
-        return FS_SCAN_DONE;
-    }
-    // The shared narrow buffer is reused by the recursion: skipped entries
-    // of this directory are named from a copy.
-    std::string directoryBytes;
-    if (statistics != nullptr) {
-        directoryBytes = narrowPath;
-        if (readError != 0) {
-            statistics->addSkipped(FsQueryStatistics::SKIP_UNREADABLE_DIRECTORY, narrowPath, nullptr, readError);
-        }
-    }
-    unsigned int start = getTickCount();
-
-    // Room for a 4095-character path, its added separator and the end mark.
-    // On the heap: a chain of one-character directories is 2000 levels deep,
-    // and 16 KB of stack per level would overflow the thread's stack.
-    std::vector<wchar_t> workBuffer(kMaxPath + 3);
-    wchar_t* work = workBuffer.data();
-    wmemcpy(work, path, pathLength);
-    size_t dirLength = pathLength;
-    if (dirLength == 0 || work[dirLength - 1] != PathHelper::PathSeparator) {
-        work[dirLength++] = PathHelper::PathSeparator;
-    }
-    work[dirLength] = 0;
-
-    // Made once per directory, on the path as given; they govern files only.
-    bool dirIncluded = includeCount == 0 || checkPathList(path, includes, caseSensitive, false);
-    bool dirExcluded = excludeCount != 0 && checkPathList(path, excludes, caseSensitive, false);
-    bool recursive = pathInfo.getRecursive();
-
-    int result = FS_SCAN_DONE;
-    int i = entryCount - 1;
-    for (; i >= 0; --i) {
-        dirent* entry = entries[i];
-        const char* entryName = entry->d_name;
-        size_t entryBytes = std::strlen(entryName);
-        size_t nameLength = 0;
-        bool reserved = reserveWide(entryBytes + 1);
-        bool converted = reserved;
-        if (converted) {
-            size_t n = mbstowcs(wideName, entryName, wideNameCapacity);
-            converted = n != static_cast<size_t>(-1) && n > 0 && n < wideNameCapacity;
-            if (converted) nameLength = n;
-        }
-        if (!converted) {
-            log->traceMID(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - file name len is 0. file skipped!\n");
-            if (statistics != nullptr && reserved) {
-                statistics->addSkipped(FsQueryStatistics::SKIP_UNDECODABLE_NAME, directoryBytes.c_str(),
-                                       entryName, 0);
-            }
-            kelm_free(entry);
-            continue;
-        }
-        if (wcscmp(wideName, L".") == 0 || wcscmp(wideName, L"..") == 0) {
-            kelm_free(entry);
-            continue;
-        }
-        if (nameLength + dirLength > kMaxPath) {
-            if (statistics != nullptr) {
-                statistics->addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, directoryBytes.c_str(), entryName, 0);
-            }
-            kelm_free(entry);
-            continue;
-        }
-
-        FsFileInfo info;
-        work[dirLength] = 0;
-        info.setFilePath(work);
-        wmemcpy(work + dirLength, wideName, nameLength + 1);
-
-        if (!excludes.empty() && checkPathList(work, excludes, caseSensitive, true)) {
-            kelm_free(entry);
-            continue;
-        }
-
-        info.setFileName(wideName);
-        bool known = info.updateInfo();  // a failure leaves attr 0: the entry is then a file
-        unsigned int attr = info.getAttr();
-        // An entry without status goes on as a file, and nothing below it is
-        // read: past the system's 4095 bytes, or refused (a directory that
-        // may be listed but not searched), or gone since the listing.
-        if (!known && statistics != nullptr) {
-            if (directoryBytes.size() + 1 + entryBytes > kMaxPath) {
-                statistics->addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, directoryBytes.c_str(), entryName, 0);
-            } else {
-                statistics->addSkipped(FsQueryStatistics::SKIP_NO_STATUS, directoryBytes.c_str(), entryName,
-                                       statusError(directoryBytes, entryName));
-            }
-        }
-
-        int subResult = FS_SCAN_DONE;
-        if (attr & FsFileInfo::ATTR_DIRECTORY) {
-            if ((attr & FsFileInfo::ATTR_SYMLINK) == 0 && recursive) {
-                if (!excludes.empty() && checkPathList(work, excludes, caseSensitive, true)) {
-                    log->traceMID(__LINE__, __FILE__, __FUNCTION__, "::fs_scan - path '%S' excluded!\n",
-                                  work);
-                } else {
-                    PathDrive child(work, recursive, static_cast<const DriveInfo&>(pathDrive));
-                    if (statistics != nullptr) statistics->addDirectory();
-                    int remaining = timeoutMs - static_cast<int>(getTickCount() - start);
-                    subResult = fs_scan(writer, processor, child, includes, excludes, caseSensitive,
-                                        remaining, statistics);
-                }
-            }
-        } else if (dirIncluded && !dirExcluded) {
-            if (statistics != nullptr) statistics->addFile();
-            unsigned int wanted = processor.processingFlags;
-            if (wanted & (FileProcessor::PROCESS_MD5 | FileProcessor::PROCESS_CRC32 |
-                          FileProcessor::PROCESS_Q32)) {
-                if (wanted & FileProcessor::PROCESS_CRC32) checksums.flags |= FILE_CHECKSUM_CRC32;
-                if (wanted & FileProcessor::PROCESS_Q32) checksums.flags |= FILE_CHECKSUM_Q32;
-                if (wanted & FileProcessor::PROCESS_MD5) checksums.flags |= FILE_CHECKSUM_MD5;
-                // Only a regular file's content is read.  A link, a pipe or a
-                // device is not opened (a pipe would block, a device may never
-                // end): the sums then still hold what the previous file of
-                // this directory left in them.
-                if ((attr & FsFileInfo::ATTR_REGULAR) != 0) {
-                    std::vector<char> narrowFile(kNarrowPathBytes);
-                    if (narrowFullPath(info.getPath(), info.getName(), narrowFile.data())) {
-                        computeRegularFileChecksumInfo(checksums, narrowFile.data());
-                    }
-                }
-            }
-            if (processor.satisfyCriteria(info, checksums, nullptr) && (!onDfs || dfsAdd)) {
-                writer.addRecord(info);
-                if (statistics != nullptr) statistics->addHit();
-            }
-        }
-        kelm_free(entry);
-        if (subResult != FS_SCAN_DONE) {
-            result = subResult;
-            break;
-        }
-    }
-    // After a stop the entries not visited yet are released here too.
-    for (int j = i - 1; j >= 0; --j) kelm_free(entries[j]);
-    kelm_free(entries);
-    return result;
+    DirectScanSink sink(writer, processor, includes, excludes, caseSensitive, statistics);
+    fscanner::WalkOptions options;
+    options.conversion = {&narrowPath, &narrowPathCapacity};
+    options.dotsBeforeStatus = true;
+    options.lengthBeforeStatus = true;
+    options.entryExcludes = &excludes;
+    options.caseSensitive = caseSensitive;
+    DirectoryWalker walker(sink, options);
+    return walker.walk(pathDrive, timeoutMs, 0);
 }
