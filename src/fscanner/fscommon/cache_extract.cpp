@@ -10,6 +10,7 @@
 #include <cwchar>
 #include <vector>
 
+#include "base/CpuThreshold.h"
 #include "base/QvLogWrapper.h"
 #include "fscanner/fs/fs_fileinfo.h"
 #include "fscanner/fs/fs_resultset.h"
@@ -146,6 +147,9 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
 
         unsigned int pathId = files.getFieldAsInt32(colPathId);
         if (pathId != lastDirectoryId) {
+            // The throttle holds the query's share of the CPU here, once per
+            // directory: a row costs nothing beyond the time check.
+            CpuThreshold::doIteration();
             log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s bIncludeFile=false", className,
                           __func__);
             if (!findPathById(directories, pathId, directoryPath, EXTRACT_PATH_CHARS)) {
