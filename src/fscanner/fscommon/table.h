@@ -266,6 +266,10 @@ private:
     // The read without the guard's checks.
     bool readRecord(unsigned int id, Fields& record);
     bool guardedRead(unsigned int id, Fields& record);
+    // The guarded read of a record whose checks all pass on its peeked
+    // bytes, decoded from them; false (record possibly half written, as
+    // after a failed read) whenever guardedRead must decide.
+    bool peekedGuardedRead(unsigned int id, Fields& record);
     // The walk over the record at offset with the column types of layout:
     // the end of the record, and per column where its bytes begin in
     // peekBytes and its value; false where readRecord would fail.
