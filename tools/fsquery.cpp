@@ -1435,6 +1435,28 @@ struct LiteralPath {
 
 // ------------------------------------------------------------- hits
 
+// The tool's --timeout as one budget for the whole run.  The engine gives
+// each of its steps the timeout it is handed, counted from the step's own
+// start (each cache build, then the extraction), so the tool hands every
+// call only what is left, and holds the hits to the end of the budget.
+class Deadline {
+public:
+    explicit Deadline(unsigned int budgetMs)
+        : budget(budgetMs), end(std::chrono::steady_clock::now() + std::chrono::milliseconds(budgetMs)) {}
+    // Milliseconds left, 0 once the budget is spent.
+    unsigned int remainingMs() const {
+        long long left = std::chrono::duration_cast<std::chrono::milliseconds>(
+                             end - std::chrono::steady_clock::now()).count();
+        if (left <= 0) return 0;
+        return left < static_cast<long long>(budget) ? static_cast<unsigned int>(left) : budget;
+    }
+    bool passed() const { return std::chrono::steady_clock::now() >= end; }
+
+private:
+    unsigned int budget;
+    std::chrono::steady_clock::time_point end;
+};
+
 // Stands between the library and the tool's output, so that a hit comes out
 // the same whichever way the query was answered.
 //
@@ -1473,12 +1495,19 @@ public:
         haveDecision = false;
     }
 
+    // The tool's one time budget, which the engine's calls each count
+    // afresh: past it every hit is refused and the run has run out of time.
+    void keepTo(const Deadline* d) { deadline = d; }
+    bool overran() const { return overrun; }
+
     int addRecord(const wchar_t* path, const wchar_t* name, unsigned long long size, unsigned int attr,
                   const wchar_t* md5, unsigned int crc32, unsigned int q32) override {
+        if (pastDeadline()) return 0;
         if (!literalPaths.empty() && !decide(path, false)) return 0;
         return target.addRecord(path, name, size, attr, md5, crc32, q32);
     }
     int addRecord(const FsFileInfo& info) override {
+        if (pastDeadline()) return 0;
         bool walkRules = resolution != nullptr && local;
         if ((walkRules || !literalPaths.empty()) && !decide(info.getPath(), walkRules)) return 0;
         bool regular = (info.getAttr() & FsFileInfo::ATTR_REGULAR) != 0;
@@ -1516,6 +1545,13 @@ public:
     int close() override { return target.close(); }
 
 private:
+    // Checked at every hit, as the engine checks its budget at every
+    // matching row.
+    bool pastDeadline() {
+        if (!overrun && deadline != nullptr && deadline->passed()) overrun = true;
+        return overrun;
+    }
+
     // The decision about the files of one directory; records of a directory
     // come together, so it is made about once per directory.
     bool decide(const wchar_t* path, bool walkRules) {
@@ -1584,6 +1620,8 @@ private:
     std::wstring lastDirectory;
     bool lastDecision = false;
     bool haveDecision = false;
+    const Deadline* deadline = nullptr;
+    bool overrun = false;
 };
 
 // An exclude path that only ever names a directory: the direct walk may
@@ -1602,12 +1640,11 @@ bool excludesOnlyADirectory(const PathInfo& p) {
 // same resolution, each tree walked by fs_build.  A root on a remote drive
 // is walked as the cache's flow walks it; the hits of a local root pass the
 // extraction's rules in the filter.
-int runDirectWalk(FsQuery& query, HitFilter& filter, const Options& o, Resolution& r, RunStats& stats) {
+int runDirectWalk(FsQuery& query, HitFilter& filter, const Deadline& deadline, Resolution& r, RunStats& stats) {
     bool caseFlag = query.getCaseSensitive();
     CpuThreshold::Initialize(query.getCpuThreshold());
     PathHelper pathHelper(1);
     filter.answerLikeTheCache(&r);
-    unsigned int start = getTickCount();
     int result = SUCCESS;
     for (size_t i = 0; i < r.roots.size(); ++i) {
         CpuThreshold::doIteration();
@@ -1636,9 +1673,8 @@ int runDirectWalk(FsQuery& query, HitFilter& filter, const Options& o, Resolutio
             pathHelper.buildExcludeList(r.drives, root, excludes);
             pathHelper.fillExclude(root, r.excludeResolved, excludes);
         }
-        unsigned int used = getTickCount() - start;
-        long left = static_cast<long>(o.timeoutMs) - static_cast<long>(used);
-        if (left < 1) left = 0;
+        // Each walk gets what is left of the run's budget.
+        long left = static_cast<long>(deadline.remainingMs());
         // No checksums and no known-checksum set here: the filter computes
         // them as the cache does.
         FileProcessor processor(query.getQuery(), caseFlag);
@@ -1647,7 +1683,7 @@ int runDirectWalk(FsQuery& query, HitFilter& filter, const Options& o, Resolutio
         int walked = fs_build(filter, processor, root, local ? r.localIncludes : r.remoteIncludes, excludes,
                               caseFlag, static_cast<int>(left), &stats.record);
         filter.endRoot();
-        if (walked == FS_SCAN_TIMED_OUT) {
+        if (walked == FS_SCAN_TIMED_OUT || filter.overran()) {
             result = SCAN_TIMED_OUT;
             break;
         }
@@ -1711,7 +1747,7 @@ private:
 // must: lock, create, query, unlock, close.  The object lives on the stack:
 // the base class has no virtual destructor.
 template <typename CacheType>
-int queryThroughCache(FsQuery& query, FsResultSetWriter& writer, const Options& o, FsGlue& glue,
+int queryThroughCache(FsQuery& query, HitFilter& writer, const Deadline& deadline, const Options& o, FsGlue& glue,
                       const std::string& directory, Progress& progress, std::atomic<long long>* hits,
                       RunStats& stats) {
     std::wstring wideDirectory = toWide(directory);
@@ -1732,7 +1768,7 @@ int queryThroughCache(FsQuery& query, FsResultSetWriter& writer, const Options& 
         return result;
     }
     errno = 0;
-    result = cache.create(o.timeoutMs, FS_CACHE_OPEN_ALWAYS);
+    result = cache.create(deadline.remainingMs(), FS_CACHE_OPEN_ALWAYS);
     if (result != SUCCESS) {
         // The engine leaves the reason its tables could not be made in errno.
         int reason = errno;
@@ -1741,8 +1777,11 @@ int queryThroughCache(FsQuery& query, FsResultSetWriter& writer, const Options& 
                      reason != 0 ? std::strerror(reason) : "");
     } else {
         progress.start(countScannedEntries, &cache.lastQueryStatistics(), hits);
-        result = cache.executeQueryEx(writer, query, o.timeoutMs, o.maxAge);
+        result = cache.executeQueryEx(writer, query, deadline.remainingMs(), o.maxAge);
         int reason = errno;  // why a cache error happened: a refused write
+        // The engine counted its budget afresh for each step; a hit that
+        // came after the run's own end means the run ran out of time.
+        if (result == SUCCESS && writer.overran()) result = SCAN_TIMED_OUT;
         progress.finish();
         stats.record = cache.lastQueryStatistics();
         if (result == CACHE_ERROR) {
@@ -1912,6 +1951,7 @@ int planPaths(const Options& o, PathPlan& plan) {
 
 int run(const Options& o) {
     auto startTime = std::chrono::steady_clock::now();
+    Deadline deadline(o.timeoutMs);
     // The configuration comes first, so that its trace settings are the ones
     // the trace handle finds.
     if (!o.configFile.empty() && !KelCfg::loadFile(o.configFile.c_str())) {
@@ -2029,6 +2069,7 @@ int run(const Options& o) {
         hits = &counting->hits;
     }
     HitFilter filter(*output, o, hashes.empty() ? nullptr : &hashes, query.getCaseSensitive());
+    filter.keepTo(&deadline);
     if (!plan.literal.empty()) {
         // The other paths' includes, as the query resolves them.
         FsQuery others;
@@ -2040,7 +2081,6 @@ int run(const Options& o) {
         PathHelper(1).extractPathList(r.resolved, mdAllDrives | dtAutoFS, includes);
         filter.holdToLiteralPaths(plan.literal, includes);
     }
-    FsResultSetWriter* writer = &filter;
     printer.header();
 
     RunStats stats;
@@ -2053,7 +2093,7 @@ int run(const Options& o) {
         progress.start(countScannedEntries, &stats.record, hits);
         Resolution resolution;
         resolveQuery(query, resolution, true, &plan.drives);
-        result = runDirectWalk(query, filter, o, resolution, stats);
+        result = runDirectWalk(query, filter, deadline, resolution, stats);
         progress.finish();
     } else {
         // An answer from the cache is printed once it is whole: a query that
@@ -2090,9 +2130,9 @@ int run(const Options& o) {
             std::fprintf(stderr, "fsquery: cannot lock the cache %s: %s/fsquery.lock: %s\n", directory.c_str(),
                          directory.c_str(), std::strerror(errno));
         } else if (o.cacheFiles.empty()) {
-            result = queryThroughCache<FS_Cache>(query, *writer, o, glue, directory, progress, hits, stats);
+            result = queryThroughCache<FS_Cache>(query, filter, deadline, o, glue, directory, progress, hits, stats);
         } else {
-            result = queryThroughCache<FS_Cache2>(query, *writer, o, glue, directory, progress, hits, stats);
+            result = queryThroughCache<FS_Cache2>(query, filter, deadline, o, glue, directory, progress, hits, stats);
         }
         toolLock.release();
         if (result == SUCCESS) printer.release();

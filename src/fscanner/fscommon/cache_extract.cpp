@@ -10,6 +10,7 @@
 #include <cwchar>
 #include <vector>
 
+#include "base/CpuThreshold.h"
 #include "base/QvLogWrapper.h"
 #include "fscanner/fs/fs_fileinfo.h"
 #include "fscanner/fs/fs_resultset.h"
@@ -17,6 +18,7 @@
 #include "fscanner/fscommon/cachetables.h"
 #include "fscanner/fscommon/checksum.h"
 #include "fscanner/fscommon/criteria.h"
+#include "fscanner/fscommon/fields.h"
 #include "fscanner/fscommon/filehash.h"
 #include "fscanner/fscommon/pathhelper.h"
 #include "fscanner/fscommon/recordset.h"
@@ -112,6 +114,21 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
     state.filtered = &files;
     state.caseSensitive = caseSensitive;
 
+    // The columns by position, looked up once; a column the table lacks
+    // reads as 0 or null, as it would by name.
+    Fields* row = files.get() != nullptr ? files.get()->getRecord() : nullptr;
+    auto position = [row](wchar_t const* name) -> unsigned int {
+        int i = row != nullptr ? row->indexOf(name) : -1;
+        return i >= 0 ? static_cast<unsigned int>(i) : 0xFFFFFFFFu;
+    };
+    const unsigned int colFileName = position(L"FILENAME");
+    const unsigned int colAttr = position(L"ATTR");
+    const unsigned int colSize = position(L"SIZE");
+    const unsigned int colPathId = position(L"PATHID");
+    const unsigned int colMd5 = position(L"MD5");
+    const unsigned int colCrc32 = position(L"CRC32");
+    const unsigned int colQ32 = position(L"Q32");
+
     PathHelper pathHelper(1);
     unsigned int lastDirectoryId = 0;
     bool includeFile = false;
@@ -128,8 +145,11 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
             return SCAN_TIMED_OUT;
         }
 
-        unsigned int pathId = files.getFieldAsInt32(L"PATHID");
+        unsigned int pathId = files.getFieldAsInt32(colPathId);
         if (pathId != lastDirectoryId) {
+            // The throttle holds the query's share of the CPU here, once per
+            // directory: a row costs nothing beyond the time check.
+            CpuThreshold::doIteration();
             log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s bIncludeFile=false", className,
                           __func__);
             if (!findPathById(directories, pathId, directoryPath, EXTRACT_PATH_CHARS)) {
@@ -195,18 +215,18 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
             FileChecksumInfo info;
             info.flags = FILE_CHECKSUM_CRC32 | FILE_CHECKSUM_Q32 | FILE_CHECKSUM_MD5;
             if (computeChecksums) {
-                info.crc32 = files.getFieldAsInt32(L"CRC32");
-                info.q32 = files.getFieldAsInt32(L"Q32");
-                wchar_t const* md5 = files.getFieldAsString(L"MD5");
+                info.crc32 = files.getFieldAsInt32(colCrc32);
+                info.q32 = files.getFieldAsInt32(colQ32);
+                wchar_t const* md5 = files.getFieldAsString(colMd5);
                 info.md5 = wchar_t2md5(md5 != nullptr ? md5 : L"0");
                 info.valid = true;
-            } else if ((files.getFieldAsInt32(L"ATTR") & LINK_ATTRIBUTE) == 0) {
+            } else if ((files.getFieldAsInt32(colAttr) & LINK_ATTRIBUTE) == 0) {
                 // A link is never opened: it keeps zero sums and find decides.
                 // The row's ATTR has no bit for a pipe or a socket, so the
                 // open itself refuses anything that is not a regular file by
                 // then: such a file counts as unreadable.
                 char narrow[EXTRACT_NARROW_BYTES];
-                narrowFilePath(directoryWithSeparator, files.getFieldAsString(L"FILENAME"), narrow,
+                narrowFilePath(directoryWithSeparator, files.getFieldAsString(colFileName), narrow,
                                sizeof(narrow));
                 if (narrow[0] != '\0' && computeRegularFileChecksumInfo(info, narrow) != 0) {
                     // A file that cannot be read counts as having zero sums.
@@ -220,10 +240,10 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
         }
         // The record carries the row as it stands: sums computed above only
         // for the filter do not reach it.
-        writer.addRecord(directoryWithSeparator, files.getFieldAsString(L"FILENAME"),
-                         files.getFieldAsInt64(L"SIZE"), files.getFieldAsInt32(L"ATTR"),
-                         files.getFieldAsString(L"MD5"), files.getFieldAsInt32(L"CRC32"),
-                         files.getFieldAsInt32(L"Q32"));
+        writer.addRecord(directoryWithSeparator, files.getFieldAsString(colFileName),
+                         files.getFieldAsInt64(colSize), files.getFieldAsInt32(colAttr),
+                         files.getFieldAsString(colMd5), files.getFieldAsInt32(colCrc32),
+                         files.getFieldAsInt32(colQ32));
         statistics.addHit();
     }
     return SUCCESS;

@@ -296,6 +296,29 @@ bool FS_CacheBase::findPathByName(RecordSet& first, RecordSet& second, wchar_t* 
     return false;
 }
 
+namespace {
+
+// Empties memo but for the entries of the chain that starts at id and climbs
+// through the parents it holds; the texts of the others are released.
+void keepMemoChain(std::map<int, MapItem>& memo, unsigned int id)
+{
+    std::map<int, MapItem> chain;
+    // Each step moves an entry out, so even a damaged cycle of parents ends.
+    for (unsigned int current = id; current != 0;) {
+        std::map<int, MapItem>::iterator it = memo.find(static_cast<int>(current));
+        if (it == memo.end())
+            break;
+        current = it->second.parentId;
+        chain.insert(*it);
+        memo.erase(it);
+    }
+    for (std::map<int, MapItem>::iterator it = memo.begin(); it != memo.end(); ++it)
+        kelm_free(it->second.text);
+    memo.swap(chain);
+}
+
+}  // namespace
+
 void FS_CacheBase::clearPathMemo()
 {
     for (std::map<int, MapItem>::iterator it = pathMemo.begin(); it != pathMemo.end(); ++it)
@@ -312,8 +335,6 @@ bool FS_CacheBase::findPathById(RecordSet& directories, unsigned int id, wchar_t
     wchar_t separator[2] = {PathHelper::PathSeparator, L'\0'};
     unsigned int current = id;
     while (current != 0) {
-        if (pathMemo.size() > cachetables::MEMO_ENTRIES)
-            clearPathMemo();
         bool failed = false;
         wchar_t* component = nullptr;
         unsigned int parent = 0;
@@ -327,14 +348,23 @@ bool FS_CacheBase::findPathById(RecordSet& directories, unsigned int id, wchar_t
         } else {
             wchar_t const* name = directories.getFieldAsString(L"PATHNAME");
             parent = directories.getFieldAsInt32(L"PARENTID");
-            component = static_cast<wchar_t*>(kelm_malloc(cachetables::MEMO_TEXT_BYTES));
+            // Past its bound the memo keeps only the chain above this row,
+            // which the walk is about to climb: rows arrive grouped by
+            // directory and directories in the order of the scan, so the
+            // ancestors are what the next rows need again.
+            if (pathMemo.size() > cachetables::MEMO_ENTRIES)
+                keepMemoChain(pathMemo, parent);
+            // A component longer than the limit is cut; the prepend below
+            // then refuses the path as too long for any buffer.
+            size_t room = cachetables::MEMO_TEXT_BYTES / sizeof(wchar_t) - 1;
+            size_t n = name != nullptr ? wcslen(name) : 0;
+            if (n > room)
+                n = room;
+            // The block is as long as the name: the memo's memory follows
+            // the names, and a flush returns small blocks that the next
+            // directories reuse.
+            component = static_cast<wchar_t*>(kelm_malloc((n + 1) * sizeof(wchar_t)));
             if (component != nullptr) {
-                // A component longer than the block is cut; the prepend
-                // below then refuses the path as too long for any buffer.
-                size_t room = cachetables::MEMO_TEXT_BYTES / sizeof(wchar_t) - 1;
-                size_t n = name != nullptr ? wcslen(name) : 0;
-                if (n > room)
-                    n = room;
                 if (n != 0)
                     wmemcpy(component, name, n);
                 component[n] = L'\0';

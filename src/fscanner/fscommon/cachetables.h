@@ -45,9 +45,11 @@ enum Variable { VAR_ID, VAR_PATHID, VAR_PARENTID, VAR_PATHNAME, VAR_SHORTPATHNAM
                 VAR_SHORTFILENAME, VAR_MD5, VAR_CRC32, VAR_Q32 };
 // Longest path, in wide characters, that the lookups rebuild.
 const unsigned int PATH_CHARS = 4096;
-// Size in bytes of one memo text.
+// Longest memo text in bytes, terminator included; a longer name is cut.
+// Each text takes a block of its own length.
 const unsigned int MEMO_TEXT_BYTES = 0x4004;
-// The memo is flushed whole once it holds more entries than this.
+// Once the memo holds more entries than this, a lookup that adds one first
+// drops all but the chain of parents above the new entry.
 const unsigned int MEMO_ENTRIES = 32;
 
 // Checks the two tables of a cache opened from disk before they serve, in

@@ -13,10 +13,66 @@
 #ifndef FSCANNER_FSCOMMON_CRITERIA_H
 #define FSCANNER_FSCOMMON_CRITERIA_H
 
+#include <string>
+#include <vector>
+
 #include "fscanner/fscommon/expvalue.h"
+#include "fscanner/fscommon/wildcard.h"
 
 class Fields;
 class SyntaxAnalyzer;
+class TreeNode;
+
+// A test that a cursor can put to the stored UTF-8 bytes of one text column
+// before it decodes a row: false only for a row on which the expression is
+// certainly 0 and whose evaluation would have had no effect on the way (no
+// command run, no failure traced), so that passing the row over unread
+// changes nothing but the time.  It knows the comparisons `[COLUMN]=="mask"`
+// of one column, comparisons of integer columns with numbers, and && and ||
+// over those, in the order the tree walk takes them; any other part counts as
+// possibly true and possibly acting.  A mask comparison gives an answer only
+// when both the mask and the stored name are plain ASCII: there the byte form
+// and the wide form agree character for character, also under the
+// case-insensitive rule (the fold table is that of towlower).  Beyond ASCII,
+// where folding or a "?" over a multibyte character could answer otherwise,
+// the row goes the full way, and the evaluator decides every row the test
+// lets through.
+class NameMaskFilter {
+public:
+    // From a parsed tree, for the columns in fields.  usable() is false when
+    // the tree holds no mask comparison on a text column.
+    NameMaskFilter(TreeNode* root, Fields* fields);
+    bool usable() const { return column >= 0; }
+    // Position of the column in the fields the filter was built for.
+    unsigned int getColumn() const { return static_cast<unsigned int>(column); }
+    // False when a row whose column holds [text, text + length) can not
+    // satisfy the expression; true when it may.
+    bool mayMatch(const unsigned char* text, size_t length, bool caseSensitive) const;
+    // The same for a text known to be plain ASCII.
+    bool mayMatchAscii(const unsigned char* text, size_t length, bool caseSensitive) const;
+
+private:
+    enum Kind { AND, OR, MASK, PURE, OTHER };
+    // What evaluating a part does: certainly 0 without effects, a value
+    // without effects, or anything.
+    enum Outcome { FALSE_QUIET, QUIET, ANY };
+    struct Node {
+        Kind kind;
+        int left;
+        int right;
+        std::string mask;  // MASK: the ASCII pattern
+        // MASK of one leading "*" and a tail without "*" and "?": the
+        // matcher's answer is then whether the text ends in the tail.
+        bool suffixOnly;
+    };
+    int add(TreeNode* node, Fields* fields, unsigned int depth);
+    Outcome evaluate(int node, const unsigned char* text, size_t length, bool caseSensitive) const;
+
+    std::vector<Node> nodes;
+    int root = -1;
+    int column = -1;
+    FoldedByteCase fold;
+};
 
 class CriteriaEvaluator {
 public:
@@ -59,6 +115,11 @@ public:
     // invalid.
     bool setHashInfo(ExpValue& value);
 
+    // The byte test of the expression for a cursor over fields, built once
+    // from the parsed tree; null when the expression has none or did not
+    // parse.  Owned by the evaluator.
+    NameMaskFilter const* getNameFilter(Fields* fields);
+
     // True when the last pass failed.
     bool hasFailed() const { return failed; }
     bool isValid() const { return valid; }
@@ -75,6 +136,9 @@ private:
     ExpValue result;
     Fields* fields;
     Fields* variables;
+    NameMaskFilter* nameFilter = nullptr;
+    Fields* filterFields = nullptr;
+    bool nameFilterBuilt = false;
 };
 
 // Evaluates texts of the characters 0 1 ( ) ! & | without blanks:

@@ -55,6 +55,22 @@ bool isHostsDirectory(const char* dir) {
 
 }  // namespace
 
+namespace {
+
+// Dummy file system types that the kernel serves itself, with no automount
+// points inside.  "autofs", "ignore" and "rootfs" are not among them: under
+// those a look-up may still wake the automounter.
+bool isKernelPseudoFileSystem(const char* type) {
+    static const char* const kinds[] = {"proc",    "procfs",  "sysfs",      "devpts", "devfs",
+                                        "fdesc",   "debugfs", "fusectl",    "securityfs", "secfs2"};
+    if (type == nullptr) return false;
+    for (const char* kind : kinds)
+        if (strcmp(type, kind) == 0) return true;
+    return false;
+}
+
+}  // namespace
+
 void accessToAllMountPaths() {
     QvLogWrapper* log = getQvLogFs();
     std::vector<MountEntry> entries;
@@ -71,6 +87,11 @@ void accessToAllMountPaths() {
                           "accessToAllMountPaths - skipping - assuming remote");
             continue;
         }
+        // The look-ups are there to make the automounter mount its keys.  In
+        // a kernel's own pseudo file system (/proc alone has an entry per
+        // process) no look-up reaches the automounter, so none is made: the
+        // drive list and the traces are the same either way.
+        if (isKernelPseudoFileSystem(entry.getFileSystemType())) continue;
         fscanner::Env* env = fscanner::Env::Current();
         DIR* directory = env->openDirectory(dir);
         if (!directory) continue;

@@ -575,24 +575,16 @@ bool SyntaxAnalyzer::resolve(fsToken& operatorToken, ExpValue& left, ExpValue& r
 
 // ---------------------------------------------------------------- tree walk
 
-namespace {
-
-// One node of the walk in progress.  The walk keeps its own stack so that a
-// long chain such as 1+1+...+1, whose tree is as deep as it is long, can't
-// exhaust the machine stack.
-struct WalkFrame {
-    explicit WalkFrame(TreeNode* n) : node(n), stage(0), cachedSet(false) {}
-    TreeNode* node;
-    int stage;
-    bool cachedSet;
-    ExpValue left;
-};
-
-}  // namespace
-
 ExpValue SyntaxAnalyzer::evaluateExp(TreeNode* node) {
     ExpValue returned;
-    std::vector<std::unique_ptr<WalkFrame>> stack;
+    // The frames of the walk are kept between walks, so that checking a row
+    // allocates nothing once the deepest tree has been walked.  A command
+    // that walks this same analyzer again from inside gets frames of its own.
+    std::vector<WalkFrame> ownFrames;
+    std::vector<WalkFrame>& frames = walking ? ownFrames : walkFrames;
+    bool outermost = !walking;
+    walking = true;
+    size_t depth = 0;
 
     // Starts a node: either its value is known at once (in `returned`), or a
     // frame is pushed and the loop goes on with it.
@@ -605,72 +597,86 @@ ExpValue SyntaxAnalyzer::evaluateExp(TreeNode* node) {
             l_value(n->token, returned);
             return true;
         }
-        stack.push_back(std::unique_ptr<WalkFrame>(new WalkFrame(n)));
+        if (depth == frames.size()) {
+            frames.emplace_back();
+        }
+        WalkFrame& pushed = frames[depth++];
+        pushed.node = n;
+        pushed.stage = 0;
+        pushed.cachedSet = false;
         return false;
     };
 
-    if (enter(node)) {
-        return returned;
-    }
-    while (!stack.empty()) {
-        WalkFrame& frame = *stack.back();
-        fsToken& token = frame.node->token;
-        if (frame.stage == 0) {
-            frame.stage = 1;
-            if (!enter(frame.node->left)) {
-                continue;
-            }
-        }
-        if (frame.stage == 1) {
-            frame.left = returned;
-            if (error) {
-                returned.clear();
-                stack.pop_back();
-                continue;
-            }
-            if (token.type == TOKEN_BOOLEAN) {
-                unsigned long long op = token.numericValue;
-                // || short-circuits on exactly 1 only; another true value
-                // evaluates the right side too.
-                if ((op == OP_LOGICAL_AND && frame.left.number == 0) ||
-                    (op == OP_LOGICAL_OR && frame.left.number == 1)) {
-                    returned.clear();
-                    returned.setNumericValue(op == OP_LOGICAL_AND ? 0 : 1);
-                    stack.pop_back();
+    if (!enter(node)) {
+        while (depth != 0) {
+            // Taken again at every turn: a push may move the frames.
+            WalkFrame& frame = frames[depth - 1];
+            fsToken& token = frame.node->token;
+            if (frame.stage == 0) {
+                frame.stage = 1;
+                if (!enter(frame.node->left)) {
                     continue;
                 }
             }
-            frame.stage = 2;
-            TreeNode* right = frame.node->right;
-            if (right != nullptr && right->token.lookup != nullptr) {
-                frame.cachedSet = true;
-                if (right->token.value.lookup != nullptr) {
-                    // The set operand was computed before: reuse it.
-                    returned = right->token.value;
+            if (frame.stage == 1) {
+                frame.left = returned;
+                if (error) {
+                    returned.clear();
+                    --depth;
+                    continue;
+                }
+                if (token.type == TOKEN_BOOLEAN) {
+                    unsigned long long op = token.numericValue;
+                    // || short-circuits on exactly 1 only; another true value
+                    // evaluates the right side too.
+                    if ((op == OP_LOGICAL_AND && frame.left.number == 0) ||
+                        (op == OP_LOGICAL_OR && frame.left.number == 1)) {
+                        returned.clear();
+                        returned.setNumericValue(op == OP_LOGICAL_AND ? 0 : 1);
+                        --depth;
+                        continue;
+                    }
+                }
+                frame.stage = 2;
+                TreeNode* right = frame.node->right;
+                if (right != nullptr && right->token.lookup != nullptr) {
+                    frame.cachedSet = true;
+                    if (right->token.value.lookup != nullptr) {
+                        // The set operand was computed before: reuse it.
+                        returned = right->token.value;
+                    } else if (!enter(right)) {
+                        continue;
+                    }
                 } else if (!enter(right)) {
                     continue;
                 }
-            } else if (!enter(right)) {
-                continue;
+            }
+            // stage 2: the right operand is in `returned`.
+            WalkFrame& current = frames[depth - 1];
+            ExpValue rightValue;
+            if (current.cachedSet) {
+                TreeNode* right = current.node->right;
+                if (right->token.value.lookup == nullptr && !error) {
+                    right->token.value = returned;
+                }
+                rightValue = right->token.value;
+            } else {
+                rightValue = returned;
+            }
+            ExpValue result;
+            if (!error) {
+                resolve(current.node->token, current.left, rightValue, result);
+            }
+            --depth;
+            if (error) {
+                returned.clear();
+            } else {
+                returned = result;
             }
         }
-        // stage 2: the right operand is in `returned`.
-        ExpValue rightValue;
-        if (frame.cachedSet) {
-            TreeNode* right = frame.node->right;
-            if (right->token.value.lookup == nullptr && !error) {
-                right->token.value = returned;
-            }
-            rightValue = right->token.value;
-        } else {
-            rightValue = returned;
-        }
-        ExpValue result;
-        if (!error) {
-            resolve(token, frame.left, rightValue, result);
-        }
-        stack.pop_back();
-        returned = error ? ExpValue() : result;
+    }
+    if (outermost) {
+        walking = false;
     }
     return returned;
 }

@@ -199,11 +199,18 @@ void Fields::copyFrom(const Fields& other) {
 }
 
 Field* Fields::name(wchar_t const* fieldName) const {
-    if (fieldName == nullptr) return nullptr;
-    for (Field* f : fields) {
-        if (f->getName() != nullptr && wcscmp(f->getName(), fieldName) == 0) return f;
+    int i = indexOf(fieldName);
+    return i >= 0 ? fields[static_cast<size_t>(i)] : nullptr;
+}
+
+int Fields::indexOf(wchar_t const* fieldName) const {
+    if (fieldName == nullptr) return -1;
+    for (size_t i = 0; i < fields.size(); ++i) {
+        wchar_t const* n = fields[i]->getName();
+        // The first character tells most column names apart without a call.
+        if (n != nullptr && n[0] == fieldName[0] && wcscmp(n, fieldName) == 0) return static_cast<int>(i);
     }
-    return nullptr;
+    return -1;
 }
 
 unsigned int Fields::size() const {

@@ -167,6 +167,9 @@ public:
     Field* at(unsigned int index) const { return fields[index]; }
     // First field whose name equals name (wcscmp), or null.
     Field* name(wchar_t const* name) const;
+    // Position of that field, or -1: a caller that reads a column row after
+    // row looks it up once and then goes by position.
+    int indexOf(wchar_t const* name) const;
     // Sum of size() over all fields.
     unsigned int size() const;
 

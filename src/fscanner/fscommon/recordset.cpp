@@ -41,7 +41,8 @@ __recordSet::__recordSet()
       index(nullptr),
       caseFlag(false),
       hasCriteria(false),
-      evaluator(nullptr) {}
+      evaluator(nullptr),
+      nameFilter(nullptr) {}
 
 __recordSet::__recordSet(FS_Table* owner)
     : id(0),
@@ -54,7 +55,8 @@ __recordSet::__recordSet(FS_Table* owner)
       index(nullptr),
       caseFlag(false),
       hasCriteria(false),
-      evaluator(nullptr) {}
+      evaluator(nullptr),
+      nameFilter(nullptr) {}
 
 __recordSet::~__recordSet() {
     kelm_free(key);
@@ -71,6 +73,7 @@ void __recordSet::forgetIndex() {
 
 bool __recordSet::setCriteria(CriteriaEvaluator* criteria, bool caseSensitive) {
     forgetIndex();
+    nameFilter = nullptr;
     evaluator = criteria;
     if (criteria == nullptr || criteria->getCriteria() == nullptr || criteria->getCriteria()[0] == L'\0') {
         hasCriteria = false;
@@ -100,6 +103,8 @@ bool __recordSet::setCriteria(CriteriaEvaluator* criteria, bool caseSensitive) {
     }
     hasCriteria = true;
     caseFlag = caseSensitive;
+    // A hash chain is short; the byte test pays on walks over the table.
+    if (index == nullptr && table != nullptr) nameFilter = criteria->getNameFilter(record);
     return true;
 }
 
@@ -107,6 +112,22 @@ bool __recordSet::setCriteria(CriteriaEvaluator* criteria, bool caseSensitive) {
 // evaluator has the last word on every candidate, also on those of a hash
 // chain, which holds collisions and stale entries.
 bool __recordSet::fits() { return !hasCriteria || evaluator->check(record, nullptr, caseFlag) > 0; }
+
+bool __recordSet::readAndDecide(bool* accepted) {
+    if (nameFilter != nullptr) {
+        const unsigned char* text = nullptr;
+        uint32_t length = 0;
+        bool ascii = false;
+        if (table->peekText(id, nameFilter->getColumn(), &text, &length, &ascii) && ascii &&
+            !nameFilter->mayMatchAscii(text, length, caseFlag)) {
+            *accepted = false;
+            return true;
+        }
+    }
+    if (!read()) return false;
+    *accepted = fits();
+    return true;
+}
 
 bool __recordSet::moveFirst() {
     if (table == nullptr) return false;
@@ -123,8 +144,9 @@ bool __recordSet::moveFirst() {
     }
     if (!table->moveFirst(id)) return false;
     for (;;) {
-        if (!read()) return false;
-        if (fits()) {
+        bool accepted = false;
+        if (!readAndDecide(&accepted)) return false;
+        if (accepted) {
             position = 0;
             return true;
         }
@@ -146,8 +168,9 @@ bool __recordSet::moveNext() {
     }
     for (;;) {
         if (!table->moveNext(id)) return false;
-        if (!read()) return false;
-        if (fits()) {
+        bool accepted = false;
+        if (!readAndDecide(&accepted)) return false;
+        if (accepted) {
             ++position;
             return true;
         }

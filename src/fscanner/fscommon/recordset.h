@@ -21,6 +21,7 @@
 class Fields;
 class Index;
 class CriteriaEvaluator;
+class NameMaskFilter;
 
 class __recordSet {
 public:
@@ -96,6 +97,10 @@ private:
 
     void forgetIndex();
     bool fits();
+    // Reads the record at id into the buffer and decides it, or, with a name
+    // filter, decides from the stored name alone a record that can not fit
+    // (the buffer is then left as it was).  False when the read fails.
+    bool readAndDecide(bool* accepted);
 
     unsigned int id;
     unsigned int position;
@@ -108,6 +113,9 @@ private:
     bool caseFlag;
     bool hasCriteria;
     CriteriaEvaluator* evaluator;
+    // The evaluator's byte test of the stored names, for walks over the
+    // whole table; null when it has none.  Owned by the evaluator.
+    NameMaskFilter const* nameFilter;
 };
 
 class RecordSet {

@@ -154,6 +154,16 @@ public:
     std::string getErrorText() const;
     Tree* getTree() const { return tree; }
 
+    // One node of a tree walk in progress.  The walk keeps its own stack so
+    // that a long chain such as 1+1+...+1, whose tree is as deep as it is
+    // long, can't exhaust the machine stack.
+    struct WalkFrame {
+        TreeNode* node = nullptr;
+        int stage = 0;
+        bool cachedSet = false;
+        ExpValue left;
+    };
+
 private:
     // Keeps message (formatted as traced) as the text of the failure that
     // just set `error`.  The analyzer's layout has no room for it: the text
@@ -179,6 +189,10 @@ private:
     bool hashOnly;
     // Factors on the recursion stack of the current pass.
     unsigned int nesting;
+    // The frames of evaluateExp, kept from walk to walk; walking is set
+    // while the outermost walk runs.
+    std::vector<WalkFrame> walkFrames;
+    bool walking = false;
 };
 
 #endif

@@ -3,6 +3,7 @@
 #include <cerrno>
 #include <cstring>
 #include <cwchar>
+#include <cwctype>
 #include <string>
 
 #include "base/kelmem.h"
@@ -12,6 +13,8 @@
 #include "fscanner/fscommon/resolvepath.h"
 #include "fscanner/fscommon/sysfactory.h"
 #include "fscanner/fscommon/table_format.h"
+#include "fscanner/fscommon/table_verify.h"
+#include "fscanner/fscommon/wildcard.h"
 #include "fscanner/fscommon/utils.h"
 
 using namespace tableformat;
@@ -570,6 +573,31 @@ bool FS_Table::readSlot(unsigned int id, uint32_t* offset) {
     return readWord(pointerFile, offset);
 }
 
+bool FS_Table::storeText(TextField* field, const unsigned char* bytes, uint32_t length) {
+    if (!growScratch(length + 1)) return false;
+    // The decoder needs a zero behind the bytes and may look a few bytes past
+    // a sequence cut short: a stored text that is not plain ASCII is copied
+    // behind a padding of zeros first.
+    if (isPlainAscii(bytes, length)) {
+        for (uint32_t i = 0; i < length; ++i) scratch[i] = static_cast<wchar_t>(bytes[i]);
+        scratch[length] = L'\0';
+    } else {
+        const unsigned int pad = 8;
+        unsigned char local[kInlineTextBytes + 1 + 8];
+        unsigned char* copy = local;
+        if (length > kInlineTextBytes) {
+            copy = static_cast<unsigned char*>(kelm_malloc(length + 1 + pad));
+            if (copy == nullptr) return false;
+        }
+        std::memset(copy, 0, (length > kInlineTextBytes ? length : kInlineTextBytes) + 1 + pad);
+        if (length != 0) std::memcpy(copy, bytes, length);
+        utils::utf8ToWideChar(scratch, scratchCapacity, copy);
+        if (copy != local) kelm_free(copy);
+    }
+    field->value(scratch);
+    return true;
+}
+
 bool FS_Table::readValue(Field* field) {
     switch (field->getType()) {
         case FIELD_INT8: {
@@ -641,11 +669,7 @@ bool FS_Table::readValue(Field* field) {
             }
             std::memset(bytes, 0, (length > kInlineTextBytes ? length : kInlineTextBytes) + 1 + pad);
             bool ok = length == 0 || dataFile->read(bytes, length) == length;
-            if (ok) ok = growScratch(length + 1);
-            if (ok) {
-                utils::utf8ToWideChar(scratch, scratchCapacity, bytes);
-                static_cast<TextField*>(field)->value(scratch);
-            }
+            if (ok) ok = storeText(static_cast<TextField*>(field), bytes, length);
             if (bytes != local) kelm_free(bytes);
             return ok;
         }
@@ -655,7 +679,50 @@ bool FS_Table::readValue(Field* field) {
 }
 
 bool FS_Table::read(unsigned int id, Fields& record) {
+    if (guard != nullptr && peekedGuardedRead(id, record)) return true;
     return guard != nullptr ? guardedRead(id, record) : readRecord(id, record);
+}
+
+bool FS_Table::peekedGuardedRead(unsigned int id, Fields& record) {
+    // Only a buffer of the table's own columns: the guard looks its keys up
+    // by name in the buffer, and the peek finds them in the schema.
+    unsigned int count = schema.count();
+    if (record.count() != count || count == 0 || count > kMaxFields) return false;
+    for (unsigned int i = 0; i < count; ++i) {
+        Field* mine = schema.at(i);
+        Field* theirs = record.at(i);
+        wchar_t const* a = mine->getName();
+        wchar_t const* b = theirs->getName();
+        if (mine->getType() != theirs->getType() || a == nullptr || b == nullptr || a[0] != b[0] || wcscmp(a, b) != 0)
+            return false;
+    }
+    if (dataFile == nullptr || pointerFile == nullptr || guard->damaged) return false;
+    uint32_t offset;
+    if (!readSlot(id, &offset) || offset == kRemovedSlot) return false;
+    uint32_t end;
+    if (!peekRecord(offset, schema, &end) || !peekPassesGuard(id, end)) return false;
+    // Every check of the guarded read passed on these bytes: store them as
+    // readRecord does.
+    unsigned char bitmap[kBitmapBufferSize];
+    unsigned int bits = bitmapSize <= kBitmapBufferSize ? bitmapSize : kBitmapBufferSize;
+    std::memset(bitmap, 0, sizeof bitmap);
+    if (bits != 0) std::memcpy(bitmap, peekBytes.data(), bits);
+    for (unsigned int i = 0; i < count; ++i) {
+        Field* field = record.at(i);
+        field->setNull(checkBit(i, bitmap));
+        PeekedColumn const& c = peekColumns[i];
+        switch (field->getType()) {
+            case FIELD_INT8: static_cast<Int8Field*>(field)->value(static_cast<unsigned char>(c.number)); break;
+            case FIELD_INT16: static_cast<Int16Field*>(field)->value(static_cast<unsigned short>(c.number)); break;
+            case FIELD_INT32: static_cast<Int32Field*>(field)->value(static_cast<unsigned int>(c.number)); break;
+            case FIELD_INT64: static_cast<Int64Field*>(field)->value(c.number); break;
+            default:
+                // Out of memory for the text: the guarded read tries again.
+                if (!storeText(static_cast<TextField*>(field), peekBytes.data() + c.at, c.length)) return false;
+                break;
+        }
+    }
+    return dataFile->seek(static_cast<long>(end), SEEK_FROM_START);
 }
 
 bool FS_Table::readRecord(unsigned int id, Fields& record) {
@@ -663,6 +730,32 @@ bool FS_Table::readRecord(unsigned int id, Fields& record) {
     if (dataFile == nullptr || pointerFile == nullptr) return true;
     uint32_t offset;
     if (!readSlot(id, &offset)) return false;
+    // The record's bytes in one read, decoded from memory; only a record
+    // that does not decode whole takes the field-by-field way below, which
+    // leaves the values read before the failure in the buffer.
+    uint32_t end;
+    if (record.count() != 0 && record.count() <= kMaxFields && peekRecord(offset, record, &end)) {
+        unsigned char bitmap[kBitmapBufferSize];
+        unsigned int bits = bitmapSize <= kBitmapBufferSize ? bitmapSize : kBitmapBufferSize;
+        std::memset(bitmap, 0, sizeof bitmap);
+        if (bits != 0) std::memcpy(bitmap, peekBytes.data(), bits);
+        bool ok = true;
+        for (unsigned int i = 0; i < record.count() && ok; ++i) {
+            Field* field = record.at(i);
+            field->setNull(checkBit(i, bitmap));
+            PeekedColumn const& c = peekColumns[i];
+            switch (field->getType()) {
+                case FIELD_INT8: static_cast<Int8Field*>(field)->value(static_cast<unsigned char>(c.number)); break;
+                case FIELD_INT16: static_cast<Int16Field*>(field)->value(static_cast<unsigned short>(c.number)); break;
+                case FIELD_INT32: static_cast<Int32Field*>(field)->value(static_cast<unsigned int>(c.number)); break;
+                case FIELD_INT64: static_cast<Int64Field*>(field)->value(c.number); break;
+                default: ok = storeText(static_cast<TextField*>(field), peekBytes.data() + c.at, c.length); break;
+            }
+        }
+        // Where the field-by-field read would have left the file.
+        if (ok) ok = dataFile->seek(static_cast<long>(end), SEEK_FROM_START);
+        if (ok) return true;
+    }
     // A removed slot (0) reads the data header as a record; callers walk with
     // the move operations, which never stop on one.
     if (!dataFile->seek(static_cast<long>(offset), SEEK_FROM_START)) return false;
@@ -678,6 +771,219 @@ bool FS_Table::readRecord(unsigned int id, Fields& record) {
         field->setNull(i < kMaxFields && checkBit(i, bitmap));
         if (!readValue(field)) return false;
     }
+    return true;
+}
+
+// ---- FS_Table: peeking at one text column ---------------------------------------
+
+namespace {
+
+// hash() of the towupper form of an ASCII text, terminator included, as an
+// index files the key.
+int hashUpperAscii(const unsigned char* text, uint32_t length, const uint32_t* upper) {
+    uint32_t acc = 0;
+    for (uint32_t i = 0; i < length; ++i) acc = acc * 37u + upper[text[i]];
+    acc = acc * 37u;  // the terminator
+    int32_t signedAcc = static_cast<int32_t>(acc);
+    int r = signedAcc % Index::BUCKETS;
+    if (r < 0) r += Index::BUCKETS;
+    return r;
+}
+
+// Most rows of the cache's tables are shorter than this; a longer one costs
+// a second read.
+const uint32_t kPeekFirstRead = 96;
+
+// hash() of the decimal text of value, as an index files a number.
+int hashDecimal(unsigned int value) {
+    wchar_t digits[12];
+    int n = 0;
+    do {
+        digits[n++] = static_cast<wchar_t>(L'0' + value % 10);
+        value /= 10;
+    } while (value != 0);
+    uint32_t acc = 0;
+    while (n > 0) acc = acc * 37u + static_cast<uint32_t>(digits[--n]);
+    acc = acc * 37u;  // the terminator
+    int32_t signedAcc = static_cast<int32_t>(acc);
+    int r = signedAcc % Index::BUCKETS;
+    if (r < 0) r += Index::BUCKETS;
+    return r;
+}
+
+}  // namespace
+
+bool FS_Table::peekRecord(uint32_t offset, Fields& layout, uint32_t* end) {
+    unsigned int count = layout.count();
+    if (count == 0 || !dataFile->seek(static_cast<long>(offset), SEEK_FROM_START)) return false;
+    if (peekColumns.size() < count) peekColumns.resize(count);
+    if (peekBytes.size() < kPeekFirstRead) peekBytes.resize(kPeekFirstRead);
+    uint32_t have = dataFile->read(peekBytes.data(), kPeekFirstRead);
+    // Makes the first n bytes of the record present; reads go on where the
+    // last one stopped.
+    auto ensure = [&](uint32_t n) -> bool {
+        if (n <= have) return true;
+        if (n > peekBytes.size()) peekBytes.resize(n > 2 * peekBytes.size() ? n : 2 * peekBytes.size());
+        have += dataFile->read(peekBytes.data() + have, static_cast<unsigned int>(peekBytes.size() - have));
+        return n <= have;
+    };
+    // The variable-length integer at pos, as readValue takes it.
+    auto compressedAt = [&](uint32_t pos, uint32_t* used, unsigned long long* value) -> bool {
+        const uint32_t longest = static_cast<uint32_t>(codec::kMaxCompressedLength);
+        if (pos + longest <= have || ensure(pos + longest)) {
+            // Every byte the encoding may take is present.
+            uint64_t v = 0;
+            int n = codec::decodeCompressed(reinterpret_cast<const char*>(peekBytes.data() + pos), longest, &v);
+            if (n == 0) return false;
+            *used = static_cast<uint32_t>(n);
+            *value = v;
+            return true;
+        }
+        // Near the end of the file: byte by byte, as far as there are bytes.
+        uint32_t n = 0;
+        for (;;) {
+            if (n == static_cast<uint32_t>(codec::kMaxCompressedLength)) return false;
+            if (!ensure(pos + n + 1)) return false;
+            if ((peekBytes[pos + n++] & 1) == 0) break;
+        }
+        uint64_t v = 0;
+        if (codec::decodeCompressed(reinterpret_cast<const char*>(peekBytes.data() + pos), n, &v) == 0) return false;
+        *used = n;
+        *value = v;
+        return true;
+    };
+    uint32_t pos = bitmapSize <= kBitmapBufferSize ? bitmapSize : kBitmapBufferSize;
+    if (!ensure(pos)) return false;
+    for (unsigned int i = 0; i < count; ++i) {
+        PeekedColumn& c = peekColumns[i];
+        unsigned int type = layout.at(i)->getType();
+        c.length = 0;
+        c.number = 0;
+        c.ascii = -1;
+        if (type == FIELD_INT8) {
+            if (!ensure(pos + 1)) return false;
+            c.at = pos;
+            c.number = peekBytes[pos];
+            pos += 1;
+        } else if (type == FIELD_INT16 || type == FIELD_INT32 || type == FIELD_INT64) {
+            unsigned long long v = 0;
+            uint32_t used = 0;
+            const char* at = reinterpret_cast<const char*>(peekBytes.data());
+            if (compressed) {
+                if (!compressedAt(pos, &used, &v)) return false;
+            } else if (type == FIELD_INT16) {
+                used = 2;
+                if (!ensure(pos + used)) return false;
+                v = codec::decodeFixed16(at + pos);
+            } else if (type == FIELD_INT32) {
+                used = 4;
+                if (!ensure(pos + used)) return false;
+                v = codec::decodeFixed32(reinterpret_cast<const char*>(peekBytes.data()) + pos);
+            } else {
+                used = 8;
+                if (!ensure(pos + used)) return false;
+                v = codec::decodeFixed64(reinterpret_cast<const char*>(peekBytes.data()) + pos);
+            }
+            // The value as the field would keep it.
+            if (type == FIELD_INT16) v = static_cast<unsigned short>(v);
+            else if (type == FIELD_INT32) v = static_cast<unsigned int>(v);
+            c.at = pos;
+            c.number = v;
+            pos += used;
+        } else if (type == FIELD_TEXT) {
+            uint32_t length = 0;
+            uint32_t used = 0;
+            if (compressed) {
+                unsigned long long v = 0;
+                if (!compressedAt(pos, &used, &v) || v > 0xFFFFull) return false;
+                length = static_cast<uint32_t>(v);
+            } else {
+                used = 2;
+                if (!ensure(pos + used)) return false;
+                length = codec::decodeFixed16(reinterpret_cast<const char*>(peekBytes.data()) + pos);
+            }
+            pos += used;
+            if (!ensure(pos + length)) return false;
+            c.at = pos;
+            c.length = length;
+            pos += length;
+        } else {
+            return false;  // type 6 is never stored: read() fails on it
+        }
+    }
+    *end = offset + pos;
+    return true;
+}
+
+bool FS_Table::peekPassesGuard(unsigned int id, uint32_t end) {
+    if (guard == nullptr) return true;
+    uint32_t nextOffset = kRemovedSlot;
+    if (id != 0xFFFFFFFFu && readSlot(id + 1, &nextOffset) && nextOffset != kRemovedSlot && nextOffset != end)
+        return false;
+    for (TableGuard::IndexBuckets const& entry : guard->indexes) {
+        if (id >= entry.bucketOf.size() || entry.bucketOf[id] == TableGuard::UNKNOWN_BUCKET) continue;
+        bool current = false;
+        for (Index* index : indexes) current = current || index == entry.index;
+        if (!current) continue;
+        // The first column of that name, as Fields::name finds it; the
+        // answer is kept per index entry, whose field never changes.
+        size_t k = static_cast<size_t>(&entry - guard->indexes.data());
+        if (peekGuardColumns.size() != guard->indexes.size()) peekGuardColumns.assign(guard->indexes.size(), {nullptr, -1});
+        if (peekGuardColumns[k].first != entry.index) {
+            int found = -1;
+            for (unsigned int i = 0; i < schema.count() && found < 0; ++i) {
+                wchar_t const* n = schema.at(i)->getName();
+                if (n != nullptr && entry.field == n) found = static_cast<int>(i);
+            }
+            peekGuardColumns[k] = {entry.index, found};
+        }
+        int column = peekGuardColumns[k].second;
+        if (column < 0) continue;
+        PeekedColumn& c = peekColumns[static_cast<size_t>(column)];
+        int bucket = -1;
+        switch (schema.at(static_cast<unsigned int>(column))->getType()) {
+            case FIELD_INT8:
+            case FIELD_INT16:
+            case FIELD_INT32:
+            case FIELD_INT64: {
+                // Keyed by the low 32 bits, as the index writes it.
+                bucket = hashDecimal(static_cast<unsigned int>(c.number));
+                break;
+            }
+            case FIELD_TEXT:
+                if (!peekedAscii(c)) return false;
+                if (!upperAsciiReady) {
+                    for (unsigned int b = 0; b < 128; ++b)
+                        upperAscii[b] = static_cast<uint32_t>(std::towupper(static_cast<wint_t>(b)));
+                    upperAsciiReady = true;
+                }
+                bucket = hashUpperAscii(peekBytes.data() + c.at, c.length, upperAscii);
+                break;
+            default:
+                return false;
+        }
+        if (bucket >= 0 && static_cast<uint32_t>(bucket) != entry.bucketOf[id]) return false;
+    }
+    return true;
+}
+
+bool FS_Table::peekedAscii(PeekedColumn& c) {
+    if (c.ascii < 0) c.ascii = isPlainAscii(peekBytes.data() + c.at, c.length) ? 1 : 0;
+    return c.ascii == 1;
+}
+
+bool FS_Table::peekText(unsigned int id, unsigned int column, const unsigned char** text, uint32_t* length,
+                        bool* ascii) {
+    if (dataFile == nullptr || pointerFile == nullptr || text == nullptr || length == nullptr) return false;
+    if (column >= schema.count() || schema.at(column)->getType() != FIELD_TEXT) return false;
+    if (guard != nullptr && guard->damaged) return false;
+    uint32_t offset;
+    if (!readSlot(id, &offset) || offset == kRemovedSlot) return false;
+    uint32_t end;
+    if (!peekRecord(offset, schema, &end) || !peekPassesGuard(id, end)) return false;
+    *text = peekBytes.data() + peekColumns[column].at;
+    *length = peekColumns[column].length;
+    if (ascii != nullptr) *ascii = peekedAscii(peekColumns[column]);
     return true;
 }
 

@@ -125,6 +125,16 @@ public:
     // table is closed.  After a read every field reports not null.  False at
     // a field of type 6 (never stored) or when the record runs past the file.
     bool read(unsigned int id, Fields& record);
+    // The stored UTF-8 bytes of the text column at position column of record
+    // id, found without decoding the record.  True only when read() of the
+    // record would succeed: every column decodes and, under the guard, every
+    // check of read() passes (an index on a text column is checked here only
+    // for plain ASCII keys).  False whenever read() could answer otherwise,
+    // and the caller then reads the record the full way.  The bytes are not
+    // zero-terminated and stay valid until the next call on the table.
+    // ascii, when not null, tells whether the bytes are plain ASCII (1..127).
+    bool peekText(unsigned int id, unsigned int column, const unsigned char** text, uint32_t* length,
+                  bool* ascii = nullptr);
     // Plain table: overwrites in place unless a text changes its character
     // count, in which case the record moves to a new number.  Compressed
     // table: always moves.  The new number is not reported.  A move whose
@@ -255,6 +265,20 @@ private:
     // The read without the guard's checks.
     bool readRecord(unsigned int id, Fields& record);
     bool guardedRead(unsigned int id, Fields& record);
+    // The guarded read of a record whose checks all pass on its peeked
+    // bytes, decoded from them; false (record possibly half written, as
+    // after a failed read) whenever guardedRead must decide.
+    bool peekedGuardedRead(unsigned int id, Fields& record);
+    // The walk over the record at offset with the column types of layout:
+    // the end of the record, and per column where its bytes begin in
+    // peekBytes and its value; false where readRecord would fail.
+    bool peekRecord(uint32_t offset, Fields& layout, uint32_t* end);
+    // Decodes length stored UTF-8 bytes into field as readValue does; false
+    // when memory runs out.
+    bool storeText(TextField* field, const unsigned char* bytes, uint32_t length);
+    // The guard's checks of guardedRead on the record just peeked; false on
+    // any doubt.
+    bool peekPassesGuard(unsigned int id, uint32_t end);
     // Keeps the buckets of a record inserted under the guard.
     void guardInsert(Fields& record, unsigned int id);
     // Keeps file and check as the damage unless one is kept; returns false.
@@ -288,6 +312,23 @@ private:
     std::vector<__recordSet*> recordSets;
     AbstractMutex* mutex;
     TableGuard* guard;
+    // peekText's copy of the record's bytes, and per column the offset of its
+    // value in it, its length for text, and its value for integers.
+    std::vector<unsigned char> peekBytes;
+    struct PeekedColumn {
+        uint32_t at;
+        uint32_t length;
+        unsigned long long number;
+        int ascii;  // text: -1 not yet known, 0 no, 1 plain ASCII
+    };
+    bool peekedAscii(PeekedColumn& c);
+    std::vector<PeekedColumn> peekColumns;
+    // Per entry of the guard's index list: its index and the column of its
+    // key, found once.
+    std::vector<std::pair<Index*, int>> peekGuardColumns;
+    // towupper of each ASCII code, for the index keys of peeked text.
+    uint32_t upperAscii[128];
+    bool upperAsciiReady = false;
 };
 
 #endif

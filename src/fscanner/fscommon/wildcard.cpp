@@ -193,6 +193,65 @@ bool wildvccmp(const wchar_t* pattern, const wchar_t* text, bool caseSensitive) 
     return caseSensitive ? wildcmp(pattern, text, false) : wildcasecmp(pattern, text, false);
 }
 
+namespace {
+
+// globCompare over bytes: the same steps, with the text's end given by a
+// pointer instead of a zero.  The callers hand only ASCII, where a byte is a
+// character and the pattern's zero is never equal to a text byte.
+template <typename Equal>
+bool byteGlobCompare(const unsigned char* p, const unsigned char* t, const unsigned char* end,
+                     Equal equal) {
+    while (t != end && *p != '*') {
+        if (*p != '?' && !equal(*p, *t)) return false;
+        ++p;
+        ++t;
+    }
+    const unsigned char* markPattern = nullptr;
+    const unsigned char* markText = nullptr;
+    while (t != end) {
+        if (*p == '*') {
+            ++p;
+            if (*p == 0) return true;
+            markPattern = p;
+            markText = t + 1;
+        } else if (*p != 0 && (*p == '?' || equal(*p, *t))) {
+            ++p;
+            ++t;
+        } else {
+            p = markPattern;
+            t = markText++;
+        }
+    }
+    while (*p == '*') ++p;
+    return *p == 0;
+}
+
+}  // namespace
+
+FoldedByteCase FoldedByteCase::fromLocale() {
+    FoldedByteCase fold;
+    for (unsigned int c = 0; c < 128; ++c) fold.lower[c] = static_cast<uint32_t>(std::towlower(static_cast<wint_t>(c)));
+    return fold;
+}
+
+bool asciiWildvccmp(const unsigned char* pattern, const unsigned char* text, size_t length,
+                    bool caseSensitive, const FoldedByteCase& fold) {
+    if (pattern == nullptr || text == nullptr) return false;
+    const unsigned char* end = text + length;
+    if (caseSensitive)
+        return byteGlobCompare(pattern, text, end, [](unsigned char a, unsigned char b) { return a == b; });
+    const uint32_t* lower = fold.lower;
+    return byteGlobCompare(pattern, text, end, [lower](unsigned char a, unsigned char b) {
+        return lower[a & 0x7F] == lower[b & 0x7F];
+    });
+}
+
+bool isPlainAscii(const unsigned char* text, size_t length) {
+    for (size_t i = 0; i < length; ++i)
+        if (text[i] == 0 || text[i] >= 0x80) return false;
+    return true;
+}
+
 bool wildpathcmp(const wchar_t* pattern, const wchar_t* text, bool recursive) {
     return pathGlobCompare<SameCase>(pattern, text, recursive);
 }

@@ -7,6 +7,8 @@
 #ifndef FSCANNER_FSCOMMON_WILDCARD_H
 #define FSCANNER_FSCOMMON_WILDCARD_H
 
+#include <cstddef>
+#include <cstdint>
 #include <cwchar>
 #include <string>
 #include <type_traits>
@@ -80,6 +82,23 @@ bool wildcmp(const wchar_t* pattern, const wchar_t* text, bool prefixOk);
 bool wildcasecmp(const wchar_t* pattern, const wchar_t* text, bool prefixOk);
 // wildcmp when caseSensitive, wildcasecmp otherwise; prefixOk false.
 bool wildvccmp(const wchar_t* pattern, const wchar_t* text, bool caseSensitive);
+
+// wildvccmp on the stored UTF-8 bytes of a name, for a pattern and a text
+// that are both plain ASCII (bytes 1..127): there each byte is one character,
+// so the answer is the one wildvccmp gives on the wide forms.  fold maps every
+// ASCII byte to towlower of it (FoldedByteCase::fromLocale); it is used only
+// when caseSensitive is false.  The text is [text, text + length) and need not
+// end in a zero; the pattern does.
+struct FoldedByteCase {
+    // towlower of each ASCII code in the current locale, which may send a
+    // letter outside ASCII (the Turkish capital I does).
+    uint32_t lower[128];
+    static FoldedByteCase fromLocale();
+};
+bool asciiWildvccmp(const unsigned char* pattern, const unsigned char* text, size_t length,
+                    bool caseSensitive, const FoldedByteCase& fold);
+// True when every byte of [text, text + length) is in 1..127.
+bool isPlainAscii(const unsigned char* text, size_t length);
 
 // Path glob: "*" and "?" cross separators.  With recursive, a pattern also
 // matches every path below it.  The text "/usr" matches "/usr/" and "/usr/*".
