@@ -23,21 +23,11 @@
 #include <ctime>
 #include "fscanner/fscommon/pathhelper.h"
 #include "fscanner/fscommon/recordset.h"
+#include "fscanner/fscommon/stringhelper.h"
 #include "fscanner/fscommon/sysfactory.h"
 #include "fscanner/fscommon/table.h"
 
 namespace {
-
-wchar_t* wideDup(wchar_t const* text)
-{
-    if (text == nullptr)
-        return nullptr;
-    size_t n = wcslen(text) + 1;
-    wchar_t* copy = static_cast<wchar_t*>(kelm_malloc(n * sizeof(wchar_t)));
-    if (copy != nullptr)
-        wmemcpy(copy, text, n);
-    return copy;
-}
 
 // Converts text into buffer (zeroed first) with at most limit bytes.  A text
 // that cannot be converted leaves the buffer empty.
@@ -110,7 +100,7 @@ void ExcludeMD5::clear()
 // --- ProviderHash -------------------------------------------------------------
 
 ProviderHash::ProviderHash(wchar_t const* name)
-    : fileName(nullptr), providerName(wideDup(name))
+    : fileName(nullptr), providerName(wideDuplicate(name))
 {
     memset(digest, 0, sizeof(digest));
 }
@@ -193,8 +183,8 @@ FS_CacheBase::FS_CacheBase(wchar_t const* directoriesTable, wchar_t const* files
     log = getQvLogFs();
     if (directoriesTable == nullptr || filesTable == nullptr || cachePath == nullptr)
         return;
-    filesTableName = wideDup(filesTable);
-    directoriesTableName = wideDup(directoriesTable);
+    filesTableName = wideDuplicate(filesTable);
+    directoriesTableName = wideDuplicate(directoriesTable);
     cachePathName = PathHelper(1).realPath(cachePath, false);
     if (cachePathName == nullptr) {
         log->traceMIN(__LINE__, __FILE__, __func__,

@@ -32,13 +32,6 @@ size_t safeLength(const wchar_t* text) { return text ? wcslen(text) : 0; }
 
 bool isResolvableStart(wchar_t c) { return c == L'*' || c == L'?' || c == L'/'; }
 
-wchar_t* wideDuplicate(const wchar_t* text) {
-    size_t length = wcslen(text);
-    wchar_t* copy = static_cast<wchar_t*>(kelm_malloc((length + 1) * sizeof(wchar_t)));
-    if (copy) wmemcpy(copy, text, length + 1);
-    return copy;
-}
-
 // Path text without a leading "drive:" part.
 const wchar_t* behindDrive(const wchar_t* path) {
     const wchar_t* colon = wcschr(path, L':');

@@ -10,6 +10,7 @@
 #include "fscanner/fscommon/codec.h"
 #include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/resolvepath.h"
+#include "fscanner/fscommon/stringhelper.h"
 #include "fscanner/fscommon/sysfactory.h"
 #include "fscanner/fscommon/table_format.h"
 #include "fscanner/fscommon/utils.h"
@@ -17,14 +18,6 @@
 using namespace tableformat;
 
 namespace {
-
-wchar_t* wideDup(wchar_t const* text) {
-    if (text == nullptr) return nullptr;
-    size_t n = wcslen(text) + 1;
-    wchar_t* copy = static_cast<wchar_t*>(kelm_malloc(n * sizeof(wchar_t)));
-    if (copy != nullptr) std::memcpy(copy, text, n * sizeof(wchar_t));
-    return copy;
-}
 
 // a + b (+ c) in a new kelm_malloc block; null when any part is null.
 wchar_t* wideJoin(wchar_t const* a, wchar_t const* b, wchar_t const* c = L"") {
@@ -148,8 +141,8 @@ int hash(unsigned int value, int buckets) {
 Index::Index(wchar_t const* idxName, wchar_t const* dir, wchar_t const* fldName)
     : file(nullptr), indexName(nullptr), fieldName(nullptr), indexFileName(nullptr), fullPath(nullptr) {
     if (idxName == nullptr || dir == nullptr || fldName == nullptr) return;
-    indexName = wideDup(idxName);
-    fieldName = wideDup(fldName);
+    indexName = wideDuplicate(idxName);
+    fieldName = wideDuplicate(fldName);
     indexFileName = cachefiles::indexFileName(idxName);
     size_t dl = wcslen(dir);
     bool hasSeparator = dl > 0 && dir[dl - 1] == L'/';
@@ -165,10 +158,10 @@ Index::Index(wchar_t const* idxName, wchar_t const* dir, wchar_t const* fldName)
 
 Index::Index(const Index& other)
     : file(nullptr),
-      indexName(wideDup(other.indexName)),
-      fieldName(wideDup(other.fieldName)),
-      indexFileName(wideDup(other.indexFileName)),
-      fullPath(wideDup(other.fullPath)) {}
+      indexName(wideDuplicate(other.indexName)),
+      fieldName(wideDuplicate(other.fieldName)),
+      indexFileName(wideDuplicate(other.indexFileName)),
+      fullPath(wideDuplicate(other.fullPath)) {}
 
 Index::~Index() {
     close();
@@ -286,7 +279,7 @@ FS_Table::FS_Table(wchar_t const* tableName, wchar_t const* dir, bool compressed
     size_t rl = wcslen(real);
     directory = wideJoin(real, (rl > 0 && real[rl - 1] == L'/') ? L"" : L"/");
     kelm_free(real);
-    name = wideDup(tableName);
+    name = wideDuplicate(tableName);
     dataFileName = cachefiles::tableDataName(tableName);
     dataPath = wideJoin(directory, dataFileName);
     pointerPath = cachefiles::tablePointerPath(directory, tableName);
