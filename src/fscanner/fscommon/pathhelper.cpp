@@ -376,8 +376,10 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
     PathDriveMap candidates;
     std::vector<PathDrive> unresolvedCandidates;
 
-    const wchar_t* defaultMedia = mask == 4 ? L"$remote" : mask == 31 ? L"$all" : mask == 0 ? L"$other"
-                                                                                              : L"$local";
+    const wchar_t* defaultMedia = mask == mdRemoteDriveGroup  ? L"$remote"
+                                  : mask == mdAllDrives       ? L"$all"
+                                  : mask == mdOtherDriveGroup ? L"$other"
+                                                              : L"$local";
     std::vector<wchar_t> buffer(PATH_BUFFER, L'\0');
     std::vector<wchar_t> specBuffer(PATH_BUFFER, L'\0');
     std::vector<wchar_t> fixed(PATH_BUFFER, L'\0');
@@ -403,13 +405,13 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
         log->traceMID(__LINE__, __FILE__, __func__,
                       "PathHelper::pathResolver - NEXT path, media: '%S', pathName: '%S', recursive: '%s'\n",
                       media.c_str(), pathText.c_str(), recursive ? "true" : "false");
-        unsigned int mediaMask = 0;
+        unsigned int mediaMask = mdOtherDriveGroup;
         if (wcscasecmp(media.c_str(), L"$local") == 0)
-            mediaMask = 27;
+            mediaMask = mdLocalDriveGroup;
         else if (wcscasecmp(media.c_str(), L"$remote") == 0)
-            mediaMask = 4;
+            mediaMask = mdRemoteDriveGroup;
         else if (wcscasecmp(media.c_str(), L"$all") == 0)
-            mediaMask = 31;
+            mediaMask = mdAllDrives;
 
         std::wstring drive;
         std::wstring name;
@@ -443,13 +445,13 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
         };
 
         if (!drive.empty() && drive[0] == L'$') {
-            unsigned int driveMask = 0;
+            unsigned int driveMask = mdOtherDriveGroup;
             if (wcscasecmp(drive.c_str(), L"$local:") == 0)
-                driveMask = 27;
+                driveMask = mdLocalDriveGroup;
             else if (wcscasecmp(drive.c_str(), L"$remote:") == 0)
-                driveMask = 4;
+                driveMask = mdRemoteDriveGroup;
             else if (wcscasecmp(drive.c_str(), L"$all:") == 0)
-                driveMask = 31;
+                driveMask = mdAllDrives;
             log->traceMID(__LINE__, __FILE__, __func__, "PathHelper::pathResolver - '%S' received on path: '%S'\n",
                           drive.c_str(), name.c_str());
             if (resolvable) {
@@ -458,7 +460,7 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
                     std::wstring search(d.getDriveName());
                     if (name[0] != L'/') search += L'/';
                     search += name;
-                    if (isValidPath(driveMap, fileSystems, 31, search.c_str(), false)) addCandidate(search, d);
+                    if (isValidPath(driveMap, fileSystems, mdAllDrives, search.c_str(), false)) addCandidate(search, d);
                 }
             }
         } else if (resolvable) {
@@ -519,7 +521,7 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
     };
     for (PathDriveMap::iterator it = candidates.begin(); it != candidates.end(); ++it) {
         CpuThreshold::doIteration();
-        if (!isValidPath(driveMap, fileSystems, 31, it->first.c_str(), false)) continue;
+        if (!isValidPath(driveMap, fileSystems, mdAllDrives, it->first.c_str(), false)) continue;
         PathInfo resolvedPath;
         PathInfo parentPath;
         if (!unix_path_resolver(it->second, resolvedPath, parentPath)) continue;
@@ -543,7 +545,7 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
     // Stage 3: what found no drive but still names a valid one.
     for (PathDrive& candidate : unresolvedCandidates) {
         const wchar_t* name = candidate.getPathName();
-        if (isValidPath(driveMap, fileSystems, 31, name, false) &&
+        if (isValidPath(driveMap, fileSystems, mdAllDrives, name, false) &&
             fileSystemPathChecker(name, includedDrivePaths, excludedDrivePaths))
             unresolved.push_back(candidate);
     }
