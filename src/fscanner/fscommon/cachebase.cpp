@@ -532,6 +532,23 @@ std::string narrowName(wchar_t const* name)
     return std::string(buffer);
 }
 
+// A side file of the cache (the update flag, the id counter) by the name
+// cachefiles makes for it: wide for the traces, narrow for the file calls.
+// made is false when no name could be made; the new[] block is released here.
+struct SideFile {
+    explicit SideFile(wchar_t* name) : made(name != nullptr)
+    {
+        if (!made)
+            return;
+        wide = name;
+        narrow = narrowName(name);
+        delete[] name;
+    }
+    bool made;
+    std::wstring wide;
+    std::string narrow;
+};
+
 }  // namespace
 
 // The likeliest reason a cache cannot be opened or made is its directory:
@@ -573,12 +590,8 @@ bool FS_CacheBase::insideCacheUpdate()
         FS_TRACE(log, MAX, "cacheChecker disabled!");
         return false;
     }
-    wchar_t* name = cachefiles::updateFlagPath(cachePathName, directoriesTableName);
-    bool inside = false;
-    if (name != nullptr) {
-        inside = cachefiles::updateFlagPresent(narrowName(name).c_str());
-        delete[] name;
-    }
+    SideFile flag(cachefiles::updateFlagPath(cachePathName, directoriesTableName));
+    bool inside = flag.made && cachefiles::updateFlagPresent(flag.narrow.c_str());
     FS_TRACE(log, MAX, "inside cache update = %s", inside ? "true" : "false");
     return inside;
 }
@@ -587,35 +600,31 @@ void FS_CacheBase::beginCacheUpdate()
 {
     if (!cacheChecker)
         return;
-    wchar_t* name = cachefiles::updateFlagPath(cachePathName, directoriesTableName);
-    if (name == nullptr)
+    SideFile flag(cachefiles::updateFlagPath(cachePathName, directoriesTableName));
+    if (!flag.made)
         return;
-    FS_TRACE(log, MAX, "begin cache update: %ls", name);
-    cachefiles::createUpdateFlag(narrowName(name).c_str());
-    delete[] name;
+    FS_TRACE(log, MAX, "begin cache update: %ls", flag.wide.c_str());
+    cachefiles::createUpdateFlag(flag.narrow.c_str());
 }
 
 void FS_CacheBase::endCacheUpdate()
 {
     if (!cacheChecker)
         return;
-    wchar_t* name = cachefiles::updateFlagPath(cachePathName, directoriesTableName);
-    if (name == nullptr)
+    SideFile flag(cachefiles::updateFlagPath(cachePathName, directoriesTableName));
+    if (!flag.made)
         return;
-    FS_TRACE(log, MAX, "end cache update: %ls", name);
-    cachefiles::removeSideFile(narrowName(name).c_str());
-    delete[] name;
+    FS_TRACE(log, MAX, "end cache update: %ls", flag.wide.c_str());
+    cachefiles::removeSideFile(flag.narrow.c_str());
 }
 
 bool FS_CacheBase::getDirectoriesIDCounter()
 {
-    wchar_t* name = cachefiles::counterPath(cachePathName, directoriesTableName);
-    if (name == nullptr)
+    SideFile counter(cachefiles::counterPath(cachePathName, directoriesTableName));
+    if (!counter.made)
         return false;
-    std::string path = narrowName(name);
-    delete[] name;
     uint32_t value = 0;
-    bool ok = cachefiles::readCounter(path.c_str(), &value);
+    bool ok = cachefiles::readCounter(counter.narrow.c_str(), &value);
     if (ok)
         directoriesIndex = value;
     return ok;
@@ -623,21 +632,15 @@ bool FS_CacheBase::getDirectoriesIDCounter()
 
 bool FS_CacheBase::updateDirectoriesIDCounter()
 {
-    wchar_t* name = cachefiles::counterPath(cachePathName, directoriesTableName);
-    if (name == nullptr)
-        return false;
-    std::string path = narrowName(name);
-    delete[] name;
-    return cachefiles::writeCounter(path.c_str(), directoriesIndex);
+    SideFile counter(cachefiles::counterPath(cachePathName, directoriesTableName));
+    return counter.made && cachefiles::writeCounter(counter.narrow.c_str(), directoriesIndex);
 }
 
 void FS_CacheBase::removeDirectoriesIDCounter()
 {
-    wchar_t* name = cachefiles::counterPath(cachePathName, directoriesTableName);
-    if (name == nullptr)
-        return;
-    cachefiles::removeSideFile(narrowName(name).c_str());
-    delete[] name;
+    SideFile counter(cachefiles::counterPath(cachePathName, directoriesTableName));
+    if (counter.made)
+        cachefiles::removeSideFile(counter.narrow.c_str());
 }
 
 void FS_CacheBase::removeCatSet()

@@ -38,15 +38,16 @@ const wchar_t* behindDrive(const wchar_t* path) {
     return colon ? colon + 1 : path;
 }
 
-}  // namespace
-
-// --- free functions -------------------------------------------------------
-
-int checkPathListEx(const wchar_t* path, std::vector<PathInfo>& list, bool caseSensitive) {
+// Index of the entry of list whose path covers path and is the longest of
+// those that do, among the entries accept lets through; the first wins a
+// tie, and an empty name never wins.  -1 for none or a null path.
+template <typename Entry, typename Accept>
+int longestCovering(const wchar_t* path, std::vector<Entry>& list, bool caseSensitive, Accept accept) {
     if (!path) return -1;
     int best = -1;
-    size_t bestLength = 0;  // an empty name can never win
+    size_t bestLength = 0;
     for (size_t i = 0; i < list.size(); ++i) {
+        if (!accept(list[i])) continue;
         const wchar_t* name = list[i].getPathName();
         size_t length = safeLength(name);
         if (length <= bestLength) continue;
@@ -58,22 +59,18 @@ int checkPathListEx(const wchar_t* path, std::vector<PathInfo>& list, bool caseS
     return best;
 }
 
+}  // namespace
+
+// --- free functions -------------------------------------------------------
+
+int checkPathListEx(const wchar_t* path, std::vector<PathInfo>& list, bool caseSensitive) {
+    return longestCovering(path, list, caseSensitive, [](const PathInfo&) { return true; });
+}
+
 int checkPathDriveListEx(const wchar_t* path, std::vector<PathDrive>& list, unsigned int mask,
                          bool caseSensitive) {
-    if (!path) return -1;
-    int best = -1;
-    size_t bestLength = 0;
-    for (size_t i = 0; i < list.size(); ++i) {
-        if ((list[i].getDriveType() & mask) == 0) continue;
-        const wchar_t* name = list[i].getPathName();
-        size_t length = safeLength(name);
-        if (length <= bestLength) continue;
-        if (wildvcpathcmp(name, path, list[i].getRecursive(), caseSensitive)) {
-            best = static_cast<int>(i);
-            bestLength = length;
-        }
-    }
-    return best;
+    return longestCovering(path, list, caseSensitive,
+                           [mask](const PathDrive& entry) { return (entry.getDriveType() & mask) != 0; });
 }
 
 // --- PathHelper: construction and plain path work -------------------------
