@@ -19,6 +19,22 @@ using namespace tableformat;
 
 namespace {
 
+// The first index of list whose name, as nameOf(index) gives it, is name;
+// taken out of list when remove.  Null for a null name or none.
+template <typename NameOf>
+Index* findIndex(std::vector<Index*>& list, NameOf nameOf, wchar_t const* name, bool remove) {
+    if (name == nullptr) return nullptr;
+    for (auto it = list.begin(); it != list.end(); ++it) {
+        wchar_t const* own = nameOf(*it);
+        if (own != nullptr && wcscmp(own, name) == 0) {
+            Index* found = *it;
+            if (remove) list.erase(it);
+            return found;
+        }
+    }
+    return nullptr;
+}
+
 // a + b (+ c) in a new kelm_malloc block; null when any part is null.
 wchar_t* wideJoin(wchar_t const* a, wchar_t const* b, wchar_t const* c = L"") {
     if (a == nullptr || b == nullptr || c == nullptr) return nullptr;
@@ -946,27 +962,13 @@ void FS_Table::freeHashIndexList(std::vector<Index*>& list) {
 }
 
 Index* FS_Table::searchHashIndexForIndexName(wchar_t const* indexName, bool removeFromList) {
-    if (indexName == nullptr) return nullptr;
-    for (auto it = indexes.begin(); it != indexes.end(); ++it) {
-        if ((*it)->getIndexName() != nullptr && wcscmp((*it)->getIndexName(), indexName) == 0) {
-            Index* found = *it;
-            if (removeFromList) indexes.erase(it);
-            return found;
-        }
-    }
-    return nullptr;
+    return findIndex(indexes, [](Index const* index) { return index->getIndexName(); }, indexName,
+                     removeFromList);
 }
 
 Index* FS_Table::searchHashIndexForFieldName(wchar_t const* fieldName, bool removeFromList) {
-    if (fieldName == nullptr) return nullptr;
-    for (auto it = indexes.begin(); it != indexes.end(); ++it) {
-        if ((*it)->getFieldName() != nullptr && wcscmp((*it)->getFieldName(), fieldName) == 0) {
-            Index* found = *it;
-            if (removeFromList) indexes.erase(it);
-            return found;
-        }
-    }
-    return nullptr;
+    return findIndex(indexes, [](Index const* index) { return index->getFieldName(); }, fieldName,
+                     removeFromList);
 }
 
 // ---- FS_Table: index building and lookup -------------------------------------
