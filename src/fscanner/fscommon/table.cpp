@@ -19,6 +19,14 @@ using namespace tableformat;
 
 namespace {
 
+// Closes and deletes file, if there is one, and leaves the pointer null.
+void closeAndDrop(AbstractFile*& file) {
+    if (file == nullptr) return;
+    file->close();
+    delete file;
+    file = nullptr;
+}
+
 // The first index of list whose name, as nameOf(index) gives it, is name;
 // taken out of list when remove.  Null for a null name or none.
 template <typename NameOf>
@@ -323,16 +331,8 @@ void FS_Table::freeNames() {
 
 FS_Table::~FS_Table() {
     freeHashIndexList(indexes);
-    if (dataFile != nullptr) {
-        dataFile->close();
-        delete dataFile;
-        dataFile = nullptr;
-    }
-    if (pointerFile != nullptr) {
-        pointerFile->close();
-        delete pointerFile;
-        pointerFile = nullptr;
-    }
+    closeAndDrop(dataFile);
+    closeAndDrop(pointerFile);
     freeNames();
     kelm_free(scratch);
     if (mutex != nullptr) {
@@ -453,16 +453,8 @@ bool FS_Table::open() {
 }
 
 bool FS_Table::close() {
-    if (dataFile != nullptr) {
-        dataFile->close();
-        delete dataFile;
-        dataFile = nullptr;
-    }
-    if (pointerFile != nullptr) {
-        pointerFile->close();
-        delete pointerFile;
-        pointerFile = nullptr;
-    }
+    closeAndDrop(dataFile);
+    closeAndDrop(pointerFile);
     freeHashIndexList(indexes);
     // A cursor never outlives the open table it walks.
     deleteRecordSets();
