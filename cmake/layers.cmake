@@ -29,7 +29,7 @@ set(FSCANNER_LAYER_base
 set(FSCANNER_LAYER_platform
   fscanner/fscommon/env fscanner/fscommon/env_posix
   fscanner/fscommon/sysfile fscanner/fscommon/sysfactory
-  fscanner/fscommon/sync fscanner/fscommon/utils)
+  fscanner/fscommon/sync fscanner/fscommon/trace fscanner/fscommon/utils)
 
 # Text and values without meaning to the engine: string and wildcard helpers,
 # the byte codec, checksums, typed fields, the owned string list, the

@@ -2,6 +2,19 @@
 
 // ------------------------------------------------------------------- writer
 
+FsFileInfo fileInfoOf(const wchar_t* path, const wchar_t* name, unsigned long long size,
+                      unsigned int attr, const wchar_t* md5, unsigned int crc32, unsigned int q32) {
+    FsFileInfo info;
+    info.setFilePath(path);
+    info.setFileName(name);
+    info.setFileSize(size);
+    info.setFileAttr(attr);
+    info.setCRC32(crc32);
+    info.setQ32(q32);
+    info.setMD5(md5);
+    return info;
+}
+
 FsResultSetWriter_OnVector::FsResultSetWriter_OnVector(std::vector<FsFileInfo>* storage)
     : records(storage) {}
 
@@ -12,14 +25,7 @@ int FsResultSetWriter_OnVector::addRecord(const wchar_t* path, const wchar_t* na
                                           const wchar_t* md5, unsigned int crc32,
                                           unsigned int q32) {
     if (records == nullptr) return -1;
-    FsFileInfo info;
-    info.setFilePath(path);
-    info.setFileName(name);
-    info.setFileSize(size);
-    info.setFileAttr(attr);
-    info.setCRC32(crc32);
-    info.setQ32(q32);
-    info.setMD5(md5);
+    FsFileInfo info = fileInfoOf(path, name, size, attr, md5, crc32, q32);
     records->push_back(info);
     return 0;
 }

@@ -17,6 +17,11 @@
 class FsResultSetReader;
 class FsResultSetWriter;
 
+// A record of the seven fields that the writers' addRecord takes, each set
+// as its setter on FsFileInfo sets it.
+FsFileInfo fileInfoOf(const wchar_t* path, const wchar_t* name, unsigned long long size,
+                      unsigned int attr, const wchar_t* md5, unsigned int crc32, unsigned int q32);
+
 class FsResultSet {
 public:
     virtual ~FsResultSet() {}

@@ -112,14 +112,7 @@ int FsResultSetWriter_OnFile::addRecord(const wchar_t* path, const wchar_t* name
                                         const wchar_t* md5, unsigned int crc32,
                                         unsigned int q32) {
     if (serializator == nullptr) return -1;
-    FsFileInfo info;
-    info.setFilePath(path);
-    info.setFileName(name);
-    info.setFileSize(size);
-    info.setFileAttr(attr);
-    info.setCRC32(crc32);
-    info.setQ32(q32);
-    info.setMD5(md5);
+    FsFileInfo info = fileInfoOf(path, name, size, attr, md5, crc32, q32);
     return info.saveObject(*serializator);
 }
 

@@ -78,6 +78,28 @@ struct StoredRecord {
     uint32_t nameOffset() const { return pathOffset() + pathLength + resultfile::kStringCountSize; }
 };
 
+// The character that starts at p in plain UTF-8 (see plainUtf8) into *c;
+// gives the bytes it takes.
+size_t plainCharacter(const unsigned char* p, uint32_t* c) {
+    unsigned char lead = p[0];
+    size_t extra;
+    if (lead < 0x80) {
+        *c = lead;
+        return 1;
+    } else if (lead < 0xE0) {
+        *c = lead & 0x1F;
+        extra = 1;
+    } else if (lead < 0xF0) {
+        *c = lead & 0x0F;
+        extra = 2;
+    } else {
+        *c = lead & 0x07;
+        extra = 3;
+    }
+    for (size_t k = 1; k <= extra; ++k) *c = (*c << 6) | (p[k] & 0x3F);
+    return extra + 1;
+}
+
 // True when bytes is shortest-form UTF-8 of characters 1 to 0x10FFFF: the
 // lenient decoder reads exactly those characters from it, and stringToUTF8
 // writes exactly these bytes for them.  Surrogate code points pass: both
@@ -352,24 +374,8 @@ public:
     bool addPlain(const unsigned char* p, size_t n) {
         size_t i = 0;
         while (i < n) {
-            unsigned char lead = p[i];
             uint32_t c;
-            size_t extra;
-            if (lead < 0x80) {
-                c = lead;
-                extra = 0;
-            } else if (lead < 0xE0) {
-                c = lead & 0x1F;
-                extra = 1;
-            } else if (lead < 0xF0) {
-                c = lead & 0x0F;
-                extra = 2;
-            } else {
-                c = lead & 0x07;
-                extra = 3;
-            }
-            for (size_t k = 1; k <= extra; ++k) c = (c << 6) | (p[i + k] & 0x3F);
-            i += extra + 1;
+            i += plainCharacter(p + i, &c);
             if (!add(c)) return false;
         }
         return true;
@@ -1044,24 +1050,8 @@ size_t plainCharacters(const unsigned char* p, uint32_t length) {
 // lenient decoder no choice), without a terminator; gives the end.
 wchar_t* decodePlain(const unsigned char* p, uint32_t length, wchar_t* out) {
     for (uint32_t i = 0; i < length;) {
-        unsigned char lead = p[i];
         uint32_t c;
-        uint32_t extra;
-        if (lead < 0x80) {
-            c = lead;
-            extra = 0;
-        } else if (lead < 0xE0) {
-            c = lead & 0x1F;
-            extra = 1;
-        } else if (lead < 0xF0) {
-            c = lead & 0x0F;
-            extra = 2;
-        } else {
-            c = lead & 0x07;
-            extra = 3;
-        }
-        for (uint32_t k = 1; k <= extra; ++k) c = (c << 6) | (p[i + k] & 0x3F);
-        i += extra + 1;
+        i += static_cast<uint32_t>(plainCharacter(p + i, &c));
         *out++ = static_cast<wchar_t>(c);
     }
     return out;

@@ -12,6 +12,7 @@
 #include "base/QvLogWrapper.h"
 #include "fscanner/fs/fs_query.h"
 #include "fscanner/fscommon/cache_files.h"
+#include "fscanner/fscommon/trace.h"
 
 namespace {
 
@@ -66,8 +67,7 @@ void FS_Cache2::saveOrRestoreFilesOrMasksForCaching(FsQuery const& constQuery)
     FsQuery& query = const_cast<FsQuery&>(constQuery);
     std::string path = catSetPath(catSetFileName);
     if (query.getFileOrMaskForCachingSetSize() == 0) {
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - reloading catalog set from cache.",
-                      className, __func__);
+        FS_TRACE(log, MIN, "reloading catalog set from cache.");
         if (catSetFileName == nullptr)
             return;
         std::vector<std::wstring> records;
@@ -80,13 +80,11 @@ void FS_Cache2::saveOrRestoreFilesOrMasksForCaching(FsQuery const& constQuery)
         for (size_t i = 0; i < records.size(); ++i)
             query.addFileOrMaskForCaching(records[i].c_str());
         if (end == cachefiles::DAMAGED_RECORD)
-            log->traceMIN(__LINE__, __FILE__, __func__,
-                          "%s::%s - damaged record of %u characters, reading stopped",
-                          className, __func__, static_cast<unsigned int>(damagedCount));
+            FS_TRACE(log, MIN, "damaged record of %u characters, reading stopped",
+                               static_cast<unsigned int>(damagedCount));
         return;
     }
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - dumping catalog set to cache.", className,
-                  __func__);
+    FS_TRACE(log, MAX, "dumping catalog set to cache.");
     if (catSetFileName == nullptr)
         return;
     // Exact names in set order, then masks in vector order.
@@ -104,7 +102,6 @@ void FS_Cache2::saveOrRestoreFilesOrMasksForCaching(FsQuery const& constQuery)
         // and quietly narrow what later builds keep.  No saved set is the
         // state a reader knows how to take.
         cachefiles::removeSideFile(path.c_str());
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - cannot write '%s': %s; it is removed",
-                      className, __func__, path.c_str(), strerror(reason));
+        FS_TRACE(log, MIN, "cannot write '%s': %s; it is removed", path.c_str(), strerror(reason));
     }
 }

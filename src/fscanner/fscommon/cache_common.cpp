@@ -75,7 +75,11 @@ void logFolderName(FILE* file, char const* name)
     fprintf(file, "%s '%s'\n", when.c_str(), name);
 }
 
-bool samePathList(std::vector<PathInfo>& a, std::vector<PathInfo>& b)
+namespace {
+
+// Same length and equal entries in the same order.
+template <typename Entry>
+bool sameList(std::vector<Entry>& a, std::vector<Entry>& b)
 {
     if (a.size() != b.size())
         return false;
@@ -86,13 +90,14 @@ bool samePathList(std::vector<PathInfo>& a, std::vector<PathInfo>& b)
     return true;
 }
 
+}  // namespace
+
+bool samePathList(std::vector<PathInfo>& a, std::vector<PathInfo>& b)
+{
+    return sameList(a, b);
+}
+
 bool sameFileSystemList(std::vector<FileSystemInfo>& a, std::vector<FileSystemInfo>& b)
 {
-    if (a.size() != b.size())
-        return false;
-    for (size_t i = 0; i < a.size(); ++i) {
-        if (!(a[i] == b[i]))
-            return false;
-    }
-    return true;
+    return sameList(a, b);
 }

@@ -23,21 +23,12 @@
 #include <ctime>
 #include "fscanner/fscommon/pathhelper.h"
 #include "fscanner/fscommon/recordset.h"
+#include "fscanner/fscommon/stringhelper.h"
 #include "fscanner/fscommon/sysfactory.h"
 #include "fscanner/fscommon/table.h"
+#include "fscanner/fscommon/trace.h"
 
 namespace {
-
-wchar_t* wideDup(wchar_t const* text)
-{
-    if (text == nullptr)
-        return nullptr;
-    size_t n = wcslen(text) + 1;
-    wchar_t* copy = static_cast<wchar_t*>(kelm_malloc(n * sizeof(wchar_t)));
-    if (copy != nullptr)
-        wmemcpy(copy, text, n);
-    return copy;
-}
 
 // Converts text into buffer (zeroed first) with at most limit bytes.  A text
 // that cannot be converted leaves the buffer empty.
@@ -110,7 +101,7 @@ void ExcludeMD5::clear()
 // --- ProviderHash -------------------------------------------------------------
 
 ProviderHash::ProviderHash(wchar_t const* name)
-    : fileName(nullptr), providerName(wideDup(name))
+    : fileName(nullptr), providerName(wideDuplicate(name))
 {
     memset(digest, 0, sizeof(digest));
 }
@@ -193,13 +184,11 @@ FS_CacheBase::FS_CacheBase(wchar_t const* directoriesTable, wchar_t const* files
     log = getQvLogFs();
     if (directoriesTable == nullptr || filesTable == nullptr || cachePath == nullptr)
         return;
-    filesTableName = wideDup(filesTable);
-    directoriesTableName = wideDup(directoriesTable);
+    filesTableName = wideDuplicate(filesTable);
+    directoriesTableName = wideDuplicate(directoriesTable);
     cachePathName = PathHelper(1).realPath(cachePath, false);
     if (cachePathName == nullptr) {
-        log->traceMIN(__LINE__, __FILE__, __func__,
-                      "%s::%s - cachePathName name is NULL, pathHelper.realPath() failed!", className,
-                      __func__);
+        FS_TRACE(log, MIN, "cachePathName name is NULL, pathHelper.realPath() failed!");
         return;
     }
     exHashFileName = cachefiles::excludeDigestsPath(cachePathName);
@@ -209,12 +198,10 @@ FS_CacheBase::FS_CacheBase(wchar_t const* directoriesTable, wchar_t const* files
     mutexName = cachefiles::accessMutexName(cachePathName);
     if (mutexName == nullptr)
         return;
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - accessMutex name is '%ls'", className,
-                  __func__, mutexName);
+    FS_TRACE(log, MAX, "accessMutex name is '%ls'", mutexName);
     accessMutex = SysFactory::createMutex(mutexName);
     if (accessMutex == nullptr) {
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - accessMutex name is NULL", className,
-                      __func__);
+        FS_TRACE(log, MIN, "accessMutex name is NULL");
         return;
     }
     if (!buildLookups())
@@ -358,32 +345,27 @@ bool FS_CacheBase::openCache()
 {
     if (!cacheInitialized)
         return false;
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - entering...", className, __func__);
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - cacheInitialized is true", className,
-                  __func__);
+    FS_TRACE(log, MAX, "entering...");
+    FS_TRACE(log, MAX, "cacheInitialized is true");
     if (insideCacheUpdate() || !getDirectoriesIDCounter() ||
         directoriesIndex >= DIRECTORIES_INDEX_LIMIT) {
-        log->traceMIN(__LINE__, __FILE__, __func__,
-                      "%s::%s() - cache corrupted or directoriesIndex invalid", className, __func__);
+        FS_TRACE_AS(log, MIN, "%s::%s() - cache corrupted or directoriesIndex invalid");
         cacheUnusable = true;
         return false;
     }
     openTable(&tbFiles, filesTableName);
     if (tbFiles == nullptr) {
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - open tbFiles failed!", className,
-                      __func__);
+        FS_TRACE(log, MIN, "open tbFiles failed!");
         return false;
     }
     openTable(&tbDirectories, directoriesTableName);
     if (tbDirectories == nullptr) {
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - open tbDirectories failed!",
-                      className, __func__);
+        FS_TRACE(log, MIN, "open tbDirectories failed!");
         deleteTable(tbFiles);
         tbFiles = nullptr;
         return false;
     }
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s() - directoriesIndex = %d", className,
-                  __func__, static_cast<int>(directoriesIndex));
+    FS_TRACE_AS(log, MAX, "%s::%s() - directoriesIndex = %d", static_cast<int>(directoriesIndex));
     beginCacheUpdate();
     cacheUnusable = false;
     openCursors();
@@ -394,12 +376,11 @@ bool FS_CacheBase::openCache()
     char const* failedCheck = nullptr;
     if (!cachetables::checkCacheTables(tbDirectories, tbFiles, directoriesIndex, &damagedFile,
                                        &failedCheck)) {
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - damaged cache file '%ls': %s",
-                      className, __func__, damagedFile.c_str(),
-                      failedCheck != nullptr ? failedCheck : "");
+        FS_TRACE(log, MIN, "damaged cache file '%ls': %s", damagedFile.c_str(),
+                           failedCheck != nullptr ? failedCheck : "");
         cacheUnusable = true;
     }
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - cache opened!", className, __func__);
+    FS_TRACE(log, MAX, "cache opened!");
     return true;
 }
 
@@ -408,32 +389,26 @@ int FS_CacheBase::create(unsigned int timeout, int creationDisposition)
     if (!cacheInitialized)
         return CACHE_ERROR;
     if (cacheOpened) {
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - retValue is CACHE_ALREADY_OPENED!",
-                      className, __func__);
+        FS_TRACE(log, MIN, "retValue is CACHE_ALREADY_OPENED!");
         return CACHE_ALREADY_OPENED;
     }
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - timeout is %u", className, __func__,
-                  timeout);
+    FS_TRACE(log, MAX, "timeout is %u", timeout);
     bool ok = false;
     switch (creationDisposition) {
     case FS_CACHE_CREATE:
-        log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - creationDisposition is FS_CACHE_CREATE",
-                      className, __func__);
+        FS_TRACE(log, MAX, "creationDisposition is FS_CACHE_CREATE");
         ok = createCache();
         break;
     case FS_CACHE_OPEN:
-        log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - creationDisposition is FS_CACHE_OPEN",
-                      className, __func__);
+        FS_TRACE(log, MAX, "creationDisposition is FS_CACHE_OPEN");
         ok = openCache();
         break;
     case FS_CACHE_OPEN_ALWAYS:
-        log->traceMAX(__LINE__, __FILE__, __func__,
-                      "%s::%s - creationDisposition is FS_CACHE_OPEN_ALWAYS", className, __func__);
+        FS_TRACE(log, MAX, "creationDisposition is FS_CACHE_OPEN_ALWAYS");
         ok = openCache() || createCache();
         break;
     default:
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - unknown creationDisposition %d",
-                      className, __func__, creationDisposition);
+        FS_TRACE(log, MIN, "unknown creationDisposition %d", creationDisposition);
         break;
     }
     int result = CACHE_ERROR;
@@ -441,8 +416,7 @@ int FS_CacheBase::create(unsigned int timeout, int creationDisposition)
     // the directory and the reading of the marks below must not replace it.
     int reason = errno;
     if (ok) {
-        log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - retValue is SUCCESS", className,
-                      __func__);
+        FS_TRACE(log, MAX, "retValue is SUCCESS");
         cacheOpened = true;
         result = SUCCESS;
     } else {
@@ -458,19 +432,15 @@ int FS_CacheBase::lock()
 {
     if (accessMutex == nullptr)
         return CACHE_ERROR;
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - waiting for accessMutex...", className,
-                  __func__);
+    FS_TRACE(log, MAX, "waiting for accessMutex...");
     int result = SUCCESS;
     if (accessMutex->wait() == 0) {
-        log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - accessMutex SUCCESS!", className,
-                      __func__);
+        FS_TRACE(log, MAX, "accessMutex SUCCESS!");
     } else {
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - accessMutex FAILED!", className,
-                      __func__);
+        FS_TRACE(log, MIN, "accessMutex FAILED!");
         result = CACHE_ERROR;
     }
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - exit. [retValue is %d]", className,
-                  __func__, result);
+    FS_TRACE(log, MAX, "exit. [retValue is %d]", result);
     return result;
 }
 
@@ -478,24 +448,19 @@ int FS_CacheBase::lock(int timeout)
 {
     if (accessMutex == nullptr)
         return CACHE_ERROR;
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - waiting for accessMutex [timeout: %d]...",
-                  className, __func__, timeout);
+    FS_TRACE(log, MAX, "waiting for accessMutex [timeout: %d]...", timeout);
     int rc = accessMutex->wait(static_cast<long>(timeout));
     int result = SUCCESS;
     if (rc == 0) {
-        log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - accessMutex SUCCESS!", className,
-                      __func__);
+        FS_TRACE(log, MAX, "accessMutex SUCCESS!");
     } else if (rc == -20) {
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - accessMutex TIMED_OUT!", className,
-                      __func__);
+        FS_TRACE(log, MIN, "accessMutex TIMED_OUT!");
         result = CACHE_LOCK_TIMED_OUT;
     } else {
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - accessMutex FAILED!", className,
-                      __func__);
+        FS_TRACE(log, MIN, "accessMutex FAILED!");
         result = CACHE_ERROR;
     }
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - exit. [retValue is %d]", className,
-                  __func__, result);
+    FS_TRACE(log, MAX, "exit. [retValue is %d]", result);
     return result;
 }
 
@@ -503,8 +468,7 @@ void FS_CacheBase::unlock()
 {
     if (accessMutex == nullptr)
         return;
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - accessMutex RELEASED!", className,
-                  __func__);
+    FS_TRACE(log, MAX, "accessMutex RELEASED!");
     accessMutex->release();
 }
 
@@ -568,6 +532,23 @@ std::string narrowName(wchar_t const* name)
     return std::string(buffer);
 }
 
+// A side file of the cache (the update flag, the id counter) by the name
+// cachefiles makes for it: wide for the traces, narrow for the file calls.
+// made is false when no name could be made; the new[] block is released here.
+struct SideFile {
+    explicit SideFile(wchar_t* name) : made(name != nullptr)
+    {
+        if (!made)
+            return;
+        wide = name;
+        narrow = narrowName(name);
+        delete[] name;
+    }
+    bool made;
+    std::wstring wide;
+    std::string narrow;
+};
+
 }  // namespace
 
 // The likeliest reason a cache cannot be opened or made is its directory:
@@ -599,26 +580,19 @@ void FS_CacheBase::traceCacheDirectoryProblem()
     }
     if (problem == nullptr)
         return;
-    log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - cache directory '%s' %s%s%s", className,
-                  __func__, directory.c_str(), problem, error != 0 ? ": " : "",
-                  error != 0 ? strerror(error) : "");
+    FS_TRACE(log, MIN, "cache directory '%s' %s%s%s", directory.c_str(), problem,
+                       error != 0 ? ": " : "", error != 0 ? strerror(error) : "");
 }
 
 bool FS_CacheBase::insideCacheUpdate()
 {
     if (!cacheChecker) {
-        log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - cacheChecker disabled!", className,
-                      __func__);
+        FS_TRACE(log, MAX, "cacheChecker disabled!");
         return false;
     }
-    wchar_t* name = cachefiles::updateFlagPath(cachePathName, directoriesTableName);
-    bool inside = false;
-    if (name != nullptr) {
-        inside = cachefiles::updateFlagPresent(narrowName(name).c_str());
-        delete[] name;
-    }
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - inside cache update = %s", className,
-                  __func__, inside ? "true" : "false");
+    SideFile flag(cachefiles::updateFlagPath(cachePathName, directoriesTableName));
+    bool inside = flag.made && cachefiles::updateFlagPresent(flag.narrow.c_str());
+    FS_TRACE(log, MAX, "inside cache update = %s", inside ? "true" : "false");
     return inside;
 }
 
@@ -626,37 +600,31 @@ void FS_CacheBase::beginCacheUpdate()
 {
     if (!cacheChecker)
         return;
-    wchar_t* name = cachefiles::updateFlagPath(cachePathName, directoriesTableName);
-    if (name == nullptr)
+    SideFile flag(cachefiles::updateFlagPath(cachePathName, directoriesTableName));
+    if (!flag.made)
         return;
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - begin cache update: %ls", className,
-                  __func__, name);
-    cachefiles::createUpdateFlag(narrowName(name).c_str());
-    delete[] name;
+    FS_TRACE(log, MAX, "begin cache update: %ls", flag.wide.c_str());
+    cachefiles::createUpdateFlag(flag.narrow.c_str());
 }
 
 void FS_CacheBase::endCacheUpdate()
 {
     if (!cacheChecker)
         return;
-    wchar_t* name = cachefiles::updateFlagPath(cachePathName, directoriesTableName);
-    if (name == nullptr)
+    SideFile flag(cachefiles::updateFlagPath(cachePathName, directoriesTableName));
+    if (!flag.made)
         return;
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - end cache update: %ls", className,
-                  __func__, name);
-    cachefiles::removeSideFile(narrowName(name).c_str());
-    delete[] name;
+    FS_TRACE(log, MAX, "end cache update: %ls", flag.wide.c_str());
+    cachefiles::removeSideFile(flag.narrow.c_str());
 }
 
 bool FS_CacheBase::getDirectoriesIDCounter()
 {
-    wchar_t* name = cachefiles::counterPath(cachePathName, directoriesTableName);
-    if (name == nullptr)
+    SideFile counter(cachefiles::counterPath(cachePathName, directoriesTableName));
+    if (!counter.made)
         return false;
-    std::string path = narrowName(name);
-    delete[] name;
     uint32_t value = 0;
-    bool ok = cachefiles::readCounter(path.c_str(), &value);
+    bool ok = cachefiles::readCounter(counter.narrow.c_str(), &value);
     if (ok)
         directoriesIndex = value;
     return ok;
@@ -664,21 +632,15 @@ bool FS_CacheBase::getDirectoriesIDCounter()
 
 bool FS_CacheBase::updateDirectoriesIDCounter()
 {
-    wchar_t* name = cachefiles::counterPath(cachePathName, directoriesTableName);
-    if (name == nullptr)
-        return false;
-    std::string path = narrowName(name);
-    delete[] name;
-    return cachefiles::writeCounter(path.c_str(), directoriesIndex);
+    SideFile counter(cachefiles::counterPath(cachePathName, directoriesTableName));
+    return counter.made && cachefiles::writeCounter(counter.narrow.c_str(), directoriesIndex);
 }
 
 void FS_CacheBase::removeDirectoriesIDCounter()
 {
-    wchar_t* name = cachefiles::counterPath(cachePathName, directoriesTableName);
-    if (name == nullptr)
-        return;
-    cachefiles::removeSideFile(narrowName(name).c_str());
-    delete[] name;
+    SideFile counter(cachefiles::counterPath(cachePathName, directoriesTableName));
+    if (counter.made)
+        cachefiles::removeSideFile(counter.narrow.c_str());
 }
 
 void FS_CacheBase::removeCatSet()
@@ -709,12 +671,10 @@ void FS_CacheBase::getMd5OfPaths(std::vector<PathInfo>& included, std::vector<Pa
                                 wcsncasecmp(path, L"$all::", 6) == 0 ||
                                 wcsncasecmp(path, L"$other::", 8) == 0)) {
             result.clear();
-            log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - md5 returned: '%s'", className,
-                          __func__, result.c_str());
+            FS_TRACE(log, MAX, "md5 returned: '%s'", result.c_str());
             return;
         }
-        log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - md5 get of '%S'", className, __func__,
-                      path != nullptr ? path : L"");
+        FS_TRACE(log, MAX, "md5 get of '%S'", path != nullptr ? path : L"");
         toNarrow(path, buffer, sizeof(buffer), cachemarks::MAX_KEY_LENGTH);
         CpuThreshold::doIteration();
         md5_update(&ctx, buffer, strlen(buffer));
@@ -732,8 +692,7 @@ void FS_CacheBase::getMd5OfPaths(std::vector<PathInfo>& included, std::vector<Pa
     char text[MD5_TEXT_SIZE];
     md5_tostr(digest, text);
     result = text;
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - md5 returned: '%s'", className, __func__,
-                  result.c_str());
+    FS_TRACE(log, MAX, "md5 returned: '%s'", result.c_str());
 }
 
 void FS_CacheBase::exclusionDigest(std::vector<PathInfo>& excludes, bool throttle,
@@ -752,8 +711,7 @@ void FS_CacheBase::exclusionDigest(std::vector<PathInfo>& excludes, bool throttl
             if (*p == '\\')
                 *p = '/';
         }
-        log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - md5 update for '%S' path of '%s'",
-                      className, __func__, path != nullptr ? path : L"", buffer);
+        FS_TRACE(log, MAX, "md5 update for '%S' path of '%s'", path != nullptr ? path : L"", buffer);
         if (throttle)
             CpuThreshold::doIteration();
         md5_update(&ctx, buffer, strlen(buffer));
@@ -781,10 +739,8 @@ bool FS_CacheBase::compareMd5OfExclude(std::vector<PathInfo>& excludes, wchar_t 
     bool same = excludeMd5[key].compare(&digest);
     char text[MD5_TEXT_SIZE];
     md5_tostr(digest, text);
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - md5 res returned: '%s'", className,
-                  __func__, same ? "true" : "false");
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - md5 res for filename '%s': '%s'",
-                  className, __func__, key.c_str(), text);
+    FS_TRACE(log, MAX, "md5 res returned: '%s'", same ? "true" : "false");
+    FS_TRACE(log, MAX, "md5 res for filename '%s': '%s'", key.c_str(), text);
     return same;
 }
 
@@ -796,8 +752,7 @@ void FS_CacheBase::updateMd5OfExclude(std::vector<PathInfo>& excludes, wchar_t c
     excludeMd5[key].update(key.c_str(), &digest);
     char text[MD5_TEXT_SIZE];
     md5_tostr(digest, text);
-    log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - md5 returned: '%s'", className, __func__,
-                  text);
+    FS_TRACE(log, MAX, "md5 returned: '%s'", text);
     writeMd5File();
 }
 
@@ -824,15 +779,13 @@ void FS_CacheBase::writeMd5File()
         return;  // a mark that cannot be made is a missing mark: silent
     for (std::map<std::string, ExcludeMD5>::const_iterator it = excludeMd5.begin();
          it != excludeMd5.end(); ++it)
-        log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s - md5 write of '%s'", className,
-                      __func__, it->first.c_str());
+        FS_TRACE(log, MAX, "md5 write of '%s'", it->first.c_str());
     // A file cut short by a full disk holds only whole records before the
     // cut, which the reader keeps; the roots whose records are missing count
     // as built under other excludes and are rebuilt.  That is the promise of
     // a missing mark, so no wrong tree is served: the failure is traced only.
     if (!written)
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - cannot write '%s': %s", className,
-                      __func__, path, strerror(reason));
+        FS_TRACE(log, MIN, "cannot write '%s': %s", path, strerror(reason));
 }
 
 void FS_CacheBase::readMd5OfExclude()
@@ -853,9 +806,8 @@ void FS_CacheBase::readMd5OfExclude()
         excludeMd5[records[i].key].update(records[i].key.c_str(), &digest);
     }
     if (end == cachefiles::DAMAGED_RECORD)
-        log->traceMIN(__LINE__, __FILE__, __func__,
-                      "%s::%s - damaged record length %u in '%s', reading stopped", className,
-                      __func__, static_cast<unsigned int>(damagedLength), path);
+        FS_TRACE(log, MIN, "damaged record length %u in '%s', reading stopped",
+                           static_cast<unsigned int>(damagedLength), path);
 }
 
 void FS_CacheBase::removeMd5FromExcludes()
@@ -872,10 +824,9 @@ void FS_CacheBase::removeMd5FromExcludes()
 int FS_CacheBase::executeQueryEx(FsResultSetWriter& writer, FsQuery const& query,
                                  unsigned int timeout, unsigned int maxCacheAge)
 {
-    log->traceMID(__LINE__, __FILE__, __func__,
-                  "%s::%s called with: query: '%S', timeout=%d, maxCacheAge=%d", className, __func__,
-                  query.getQuery() != nullptr ? query.getQuery() : L"", static_cast<int>(timeout),
-                  static_cast<int>(maxCacheAge));
+    FS_TRACE_AS(log, MID, "%s::%s called with: query: '%S', timeout=%d, maxCacheAge=%d",
+                          query.getQuery() != nullptr ? query.getQuery() : L"",
+                          static_cast<int>(timeout), static_cast<int>(maxCacheAge));
     queryStatistics().reset();
     if (!cacheInitialized || !cacheOpened || cacheUnusable)
         return CACHE_UNUSABLE;
@@ -885,8 +836,8 @@ int FS_CacheBase::executeQueryEx(FsResultSetWriter& writer, FsQuery const& query
     // A read that met damage ended its walk early: what the writer got is
     // not the answer, whatever the flow returned.
     if (FS_Table* damaged = damagedTable(tbFiles, tbDirectories)) {
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - damaged cache file '%ls': %s",
-                      className, __func__, damaged->damagedFile(), damaged->damagedCheck());
+        FS_TRACE(log, MIN, "damaged cache file '%ls': %s", damaged->damagedFile(),
+                           damaged->damagedCheck());
         result = CACHE_UNUSABLE;
     }
     if (result == CACHE_UNUSABLE || result == BUILD_TIMED_OUT) {
@@ -899,9 +850,7 @@ int FS_CacheBase::executeQueryEx(FsResultSetWriter& writer, FsQuery const& query
     if ((result == SUCCESS || result == CACHE_ERROR) && directoriesIndex > indexBefore &&
         !updateDirectoriesIDCounter()) {
         int counterReason = errno;
-        log->traceMIN(__LINE__, __FILE__, __func__,
-                      "%s::%s - cannot save the directory id counter: %s", className, __func__,
-                      strerror(counterReason));
+        FS_TRACE(log, MIN, "cannot save the directory id counter: %s", strerror(counterReason));
         if (result == SUCCESS) {
             result = CACHE_ERROR;
             reason = counterReason;
@@ -930,17 +879,14 @@ int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery con
         int fields = threshold != nullptr ? sscanf(threshold, "%d:%d:%ld:%ld", &a, &b, &run, &sleepTime)
                                           : 0;
         if (threshold == nullptr || fields < 4) {
-            log->traceMIN(__LINE__, __FILE__, __func__,
-                          "IMPORTANT: %s::%s - CpuThreshold is set to: 0:0:0:0", className, __func__);
+            FS_TRACE_AS(log, MIN, "IMPORTANT: %s::%s - CpuThreshold is set to: 0:0:0:0");
         } else if (sleepTime == 0 || run + sleepTime == 0) {
-            log->traceMIN(__LINE__, __FILE__, __func__,
-                          "IMPORTANT: %s::%s - CpuThreshold is set to : 100%% (%s).", className,
-                          __func__, threshold);
+            FS_TRACE_AS(log, MIN, "IMPORTANT: %s::%s - CpuThreshold is set to : 100%% (%s).",
+                                  threshold);
         } else {
             float percent = static_cast<float>(run) / static_cast<float>(run + sleepTime) * 100.0f;
-            log->traceMIN(__LINE__, __FILE__, __func__,
-                          "IMPORTANT: %s::%s - CpuThreshold is set to: %0.1f%% (%s).", className,
-                          __func__, static_cast<double>(percent), threshold);
+            FS_TRACE_AS(log, MIN, "IMPORTANT: %s::%s - CpuThreshold is set to: %0.1f%% (%s).",
+                                  static_cast<double>(percent), threshold);
         }
         driveList.clear();
         driveHelper.setAssumeAutoFSDriveType(query.getAssumeAutoFSDriveType());
@@ -1032,14 +978,10 @@ int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery con
     bool markExact = false;
     if (!providerHash.readMd5OfProvider(&markExact)) {
         cacheValid = false;
-        log->traceMID(__LINE__, __FILE__, __func__,
-                      "%s::%s - (cacheValid check1) unable to determine previous provider, therefore cache is invalid.",
-                      className, __func__);
+        FS_TRACE(log, MID, "(cacheValid check1) unable to determine previous provider, therefore cache is invalid.");
     } else if (!providerHash.compareMd5OfProvider(providerHash.providerName)) {
         cacheValid = false;
-        log->traceMID(__LINE__, __FILE__, __func__,
-                      "%s::%s - (cacheValid check1) previous provider differs, therefore cache is invalid.",
-                      className, __func__);
+        FS_TRACE(log, MID, "(cacheValid check1) previous provider differs, therefore cache is invalid.");
     } else {
         cacheValid = true;
     }
@@ -1048,9 +990,7 @@ int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery con
     // directory's disk for the next sync.
     bool markCurrent = cacheValid && markExact;
     if (!markCurrent && !providerHash.updateMd5OfProvider())
-        log->traceMID(__LINE__, __FILE__, __func__,
-                      "%s::%s - (cacheValid check1) failed to update previous cache MD5 for future scans!",
-                      className, __func__);
+        FS_TRACE(log, MID, "(cacheValid check1) failed to update previous cache MD5 for future scans!");
     saveOrRestoreFilesOrMasksForCaching(query);
 
     // F. Visit the roots, unless this object saw the same paths last time:
@@ -1065,9 +1005,8 @@ int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery con
             bool remote = !cacheRemoteDrives &&
                           (static_cast<unsigned int>(root.getDriveType()) & mdLocalDriveGroup) == 0;
             if (remote) {
-                log->traceMID(__LINE__, __FILE__, __func__,
-                              "%s::%s - scanning [mdRemoteDriveGroup] and [mdOtherDriveGroup] [%S] path...",
-                              className, __func__, rootPath);
+                FS_TRACE(log, MID, "scanning [mdRemoteDriveGroup] and [mdOtherDriveGroup] [%S] path...",
+                                   rootPath);
                 remoteExcludePaths.clear();
                 pathHelper.extractPathList(excludeResolved, mdRemoteDriveGroup, remoteExcludePaths);
                 pathHelper.extractPathList(excludeResolved, mdOtherDriveGroup, remoteExcludePaths);
@@ -1087,8 +1026,7 @@ int FS_CacheBase::executeQueryCacheOnlyEx(FsResultSetWriter& writer, FsQuery con
                 // end of extractResults).
                 cmdTokenTable().clear();
                 if (rc == 2) {
-                    log->traceMIN(__LINE__, __FILE__, __func__,
-                                  "%s::%s - fs scanning timed out (timeout)", className, __func__);
+                    FS_TRACE(log, MIN, "fs scanning timed out (timeout)");
                     return SCAN_TIMED_OUT;
                 }
                 continue;
@@ -1286,8 +1224,7 @@ void FS_CacheBase::removeRowsAbove(unsigned int lastKeptId)
             set.remove();
     }
     if (!tbDirectories->closeRecordSet(set))
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - closeRecordSet failed!", className,
-                      __func__);
+        FS_TRACE(log, MIN, "closeRecordSet failed!");
 }
 
 int FS_CacheBase::extractFromCache(FsResultSetWriter& writer, FsQuery const& query,

@@ -16,15 +16,17 @@
 #include <string>
 
 #include "fscanner/fscommon/expvalue.h"
+#include "fscanner/fscommon/fields.h"
 #include "fscanner/fscommon/filetypehelper.h"
 
 class FS_CacheBase;
 class FS_Table;
 
 namespace cachetables {
-const unsigned int TYPE_INT32 = 3;
-const unsigned int TYPE_INT64 = 4;
-const unsigned int TYPE_TEXT = 5;
+// The column types of the schema, as the table's fields name them.
+const unsigned int TYPE_INT32 = FIELD_INT32;
+const unsigned int TYPE_INT64 = FIELD_INT64;
+const unsigned int TYPE_TEXT = FIELD_TEXT;
 const unsigned int DIRECTORY_COLUMNS = 4;
 const unsigned int FILE_COLUMNS = 7;
 extern wchar_t const* const directoryColumns[DIRECTORY_COLUMNS];

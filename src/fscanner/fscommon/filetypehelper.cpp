@@ -26,14 +26,6 @@ namespace {
 const int EMPTY_ID = -1;
 const int BATCH_MODULUS = 65536;
 
-wchar_t* duplicateWide(wchar_t const* text) {
-    if (text == nullptr) return nullptr;
-    size_t length = wcslen(text);
-    wchar_t* copy = static_cast<wchar_t*>(kelm_malloc((length + 1) * sizeof(wchar_t)));
-    if (copy != nullptr) wmemcpy(copy, text, length + 1);
-    return copy;
-}
-
 // Narrow form of a wide text in the current locale; false when a character
 // has no narrow form.
 bool toNarrow(wchar_t const* text, std::string& out) {
@@ -90,14 +82,14 @@ int& batchNumber() {
 
 Element::Element() : id(EMPTY_ID), fileTypeInfo(nullptr) {}
 
-Element::Element(int id, wchar_t const* text) : id(id), fileTypeInfo(duplicateWide(text)) {}
+Element::Element(int id, wchar_t const* text) : id(id), fileTypeInfo(wideDuplicate(text)) {}
 
 Element::Element(Element const& other)
-    : id(other.id), fileTypeInfo(duplicateWide(other.fileTypeInfo)) {}
+    : id(other.id), fileTypeInfo(wideDuplicate(other.fileTypeInfo)) {}
 
 Element& Element::operator=(Element const& other) {
     if (this != &other) {
-        wchar_t* copy = duplicateWide(other.fileTypeInfo);
+        wchar_t* copy = wideDuplicate(other.fileTypeInfo);
         kelm_free(fileTypeInfo);
         fileTypeInfo = copy;
         id = other.id;
@@ -112,7 +104,7 @@ int Element::getID() const { return id; }
 wchar_t* Element::getFileTypeInfo() const { return fileTypeInfo; }
 
 void Element::setData(int newId, wchar_t* text, bool copy) {
-    wchar_t* owned = copy ? duplicateWide(text) : text;
+    wchar_t* owned = copy ? wideDuplicate(text) : text;
     if (owned != fileTypeInfo) kelm_free(fileTypeInfo);
     fileTypeInfo = owned;
     id = newId;
@@ -283,7 +275,7 @@ bool FileTypeChecker::getFileType(wchar_t const* path, wchar_t** out) {
                       "FileTypeChecker::getFileType - output line for '%S' has no wide form\n", path);
         return false;
     }
-    wchar_t* line = duplicateWide(wbuffer);
+    wchar_t* line = wideDuplicate(wbuffer);
     if (line == nullptr) return false;
     *out = line;
     return true;
@@ -496,7 +488,7 @@ int FileTypeChecker::makeListFile(char const* dir, char const* listFile) {
 
 bool FileTypeChecker::fileTypeSplitter(wchar_t* text, StringList<wchar_t>& words) {
     if (text == nullptr) return false;
-    wchar_t* copy = duplicateWide(text);
+    wchar_t* copy = wideDuplicate(text);
     if (copy == nullptr) return false;
     bool any = false;
     bool ok = true;
@@ -539,7 +531,7 @@ bool FileTypeChecker::checkTypeList(StringList<wchar_t>& fileWords, StringList<w
 // stands behind the path, tabs and line feeds made blanks, trimmed.  False
 // for an empty description.
 bool FileTypeChecker::describeLine(wchar_t const* path, wchar_t const* line, StringList<wchar_t>& words) {
-    wchar_t* description = duplicateWide(line + wcslen(path));
+    wchar_t* description = wideDuplicate(line + wcslen(path));
     if (description == nullptr) return false;
     replaceChar(description, tab, L' ');
     replaceChar(description, lineFeed, L' ');

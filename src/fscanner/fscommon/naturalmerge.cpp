@@ -154,13 +154,7 @@ public:
     bool seek(long offset, int origin) override {
         atEnd = false;
         long long target;
-        switch (origin) {
-            case SEEK_FROM_START: target = offset; break;
-            case SEEK_FROM_CURRENT: target = static_cast<long long>(position) + offset; break;
-            case SEEK_FROM_END: target = static_cast<long long>(logical) + offset; break;
-            default: return false;
-        }
-        if (target < 0 || target > static_cast<long long>(logical)) return false;
+        if (!seekTarget(offset, origin, position, logical, &target)) return false;
         position = static_cast<uint64_t>(target);
         return true;
     }
@@ -354,28 +348,23 @@ void NaturalMergeSort::mergerun(AbstractFile* a, AbstractFile* b, AbstractFile* 
             }
             return;
         }
-        if (compareRecords(headA, headB, mergeOperator, caseFlag)) {
+        // The side whose head goes first gives one record; when its run
+        // ends there, the rest of the other side's run follows and the
+        // merged run is complete.
+        const bool fromA = compareRecords(headA, headB, mergeOperator, caseFlag);
+        AbstractFile* from = fromA ? a : b;
+        AbstractFile* other = fromA ? b : a;
+        void*& headFrom = fromA ? headA : headB;
+        void*& headOther = fromA ? headB : headA;
+        freeRecord(headFrom);
+        headFrom = nullptr;
+        if (copy(from, target, &headFrom)) {
+            freeRecord(headOther);
+            headOther = nullptr;
+            copyrun(other, target, &headOther);
             freeRecord(headA);
-            headA = nullptr;
-            if (copy(a, target, &headA)) {
-                freeRecord(headB);
-                headB = nullptr;
-                copyrun(b, target, &headB);
-                freeRecord(headA);
-                freeRecord(headB);
-                return;
-            }
-        } else {
             freeRecord(headB);
-            headB = nullptr;
-            if (copy(b, target, &headB)) {
-                freeRecord(headA);
-                headA = nullptr;
-                copyrun(a, target, &headA);
-                freeRecord(headA);
-                freeRecord(headB);
-                return;
-            }
+            return;
         }
     }
 }

@@ -32,17 +32,31 @@ size_t safeLength(const wchar_t* text) { return text ? wcslen(text) : 0; }
 
 bool isResolvableStart(wchar_t c) { return c == L'*' || c == L'?' || c == L'/'; }
 
-wchar_t* wideDuplicate(const wchar_t* text) {
-    size_t length = wcslen(text);
-    wchar_t* copy = static_cast<wchar_t*>(kelm_malloc((length + 1) * sizeof(wchar_t)));
-    if (copy) wmemcpy(copy, text, length + 1);
-    return copy;
-}
-
 // Path text without a leading "drive:" part.
 const wchar_t* behindDrive(const wchar_t* path) {
     const wchar_t* colon = wcschr(path, L':');
     return colon ? colon + 1 : path;
+}
+
+// Index of the entry of list whose path covers path and is the longest of
+// those that do, among the entries accept lets through; the first wins a
+// tie, and an empty name never wins.  -1 for none or a null path.
+template <typename Entry, typename Accept>
+int longestCovering(const wchar_t* path, std::vector<Entry>& list, bool caseSensitive, Accept accept) {
+    if (!path) return -1;
+    int best = -1;
+    size_t bestLength = 0;
+    for (size_t i = 0; i < list.size(); ++i) {
+        if (!accept(list[i])) continue;
+        const wchar_t* name = list[i].getPathName();
+        size_t length = safeLength(name);
+        if (length <= bestLength) continue;
+        if (wildvcpathcmp(name, path, list[i].getRecursive(), caseSensitive)) {
+            best = static_cast<int>(i);
+            bestLength = length;
+        }
+    }
+    return best;
 }
 
 }  // namespace
@@ -50,37 +64,13 @@ const wchar_t* behindDrive(const wchar_t* path) {
 // --- free functions -------------------------------------------------------
 
 int checkPathListEx(const wchar_t* path, std::vector<PathInfo>& list, bool caseSensitive) {
-    if (!path) return -1;
-    int best = -1;
-    size_t bestLength = 0;  // an empty name can never win
-    for (size_t i = 0; i < list.size(); ++i) {
-        const wchar_t* name = list[i].getPathName();
-        size_t length = safeLength(name);
-        if (length <= bestLength) continue;
-        if (wildvcpathcmp(name, path, list[i].getRecursive(), caseSensitive)) {
-            best = static_cast<int>(i);
-            bestLength = length;
-        }
-    }
-    return best;
+    return longestCovering(path, list, caseSensitive, [](const PathInfo&) { return true; });
 }
 
 int checkPathDriveListEx(const wchar_t* path, std::vector<PathDrive>& list, unsigned int mask,
                          bool caseSensitive) {
-    if (!path) return -1;
-    int best = -1;
-    size_t bestLength = 0;
-    for (size_t i = 0; i < list.size(); ++i) {
-        if ((list[i].getDriveType() & mask) == 0) continue;
-        const wchar_t* name = list[i].getPathName();
-        size_t length = safeLength(name);
-        if (length <= bestLength) continue;
-        if (wildvcpathcmp(name, path, list[i].getRecursive(), caseSensitive)) {
-            best = static_cast<int>(i);
-            bestLength = length;
-        }
-    }
-    return best;
+    return longestCovering(path, list, caseSensitive,
+                           [mask](const PathDrive& entry) { return (entry.getDriveType() & mask) != 0; });
 }
 
 // --- PathHelper: construction and plain path work -------------------------
@@ -383,8 +373,10 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
     PathDriveMap candidates;
     std::vector<PathDrive> unresolvedCandidates;
 
-    const wchar_t* defaultMedia = mask == 4 ? L"$remote" : mask == 31 ? L"$all" : mask == 0 ? L"$other"
-                                                                                              : L"$local";
+    const wchar_t* defaultMedia = mask == mdRemoteDriveGroup  ? L"$remote"
+                                  : mask == mdAllDrives       ? L"$all"
+                                  : mask == mdOtherDriveGroup ? L"$other"
+                                                              : L"$local";
     std::vector<wchar_t> buffer(PATH_BUFFER, L'\0');
     std::vector<wchar_t> specBuffer(PATH_BUFFER, L'\0');
     std::vector<wchar_t> fixed(PATH_BUFFER, L'\0');
@@ -410,13 +402,13 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
         log->traceMID(__LINE__, __FILE__, __func__,
                       "PathHelper::pathResolver - NEXT path, media: '%S', pathName: '%S', recursive: '%s'\n",
                       media.c_str(), pathText.c_str(), recursive ? "true" : "false");
-        unsigned int mediaMask = 0;
+        unsigned int mediaMask = mdOtherDriveGroup;
         if (wcscasecmp(media.c_str(), L"$local") == 0)
-            mediaMask = 27;
+            mediaMask = mdLocalDriveGroup;
         else if (wcscasecmp(media.c_str(), L"$remote") == 0)
-            mediaMask = 4;
+            mediaMask = mdRemoteDriveGroup;
         else if (wcscasecmp(media.c_str(), L"$all") == 0)
-            mediaMask = 31;
+            mediaMask = mdAllDrives;
 
         std::wstring drive;
         std::wstring name;
@@ -450,13 +442,13 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
         };
 
         if (!drive.empty() && drive[0] == L'$') {
-            unsigned int driveMask = 0;
+            unsigned int driveMask = mdOtherDriveGroup;
             if (wcscasecmp(drive.c_str(), L"$local:") == 0)
-                driveMask = 27;
+                driveMask = mdLocalDriveGroup;
             else if (wcscasecmp(drive.c_str(), L"$remote:") == 0)
-                driveMask = 4;
+                driveMask = mdRemoteDriveGroup;
             else if (wcscasecmp(drive.c_str(), L"$all:") == 0)
-                driveMask = 31;
+                driveMask = mdAllDrives;
             log->traceMID(__LINE__, __FILE__, __func__, "PathHelper::pathResolver - '%S' received on path: '%S'\n",
                           drive.c_str(), name.c_str());
             if (resolvable) {
@@ -465,7 +457,7 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
                     std::wstring search(d.getDriveName());
                     if (name[0] != L'/') search += L'/';
                     search += name;
-                    if (isValidPath(driveMap, fileSystems, 31, search.c_str(), false)) addCandidate(search, d);
+                    if (isValidPath(driveMap, fileSystems, mdAllDrives, search.c_str(), false)) addCandidate(search, d);
                 }
             }
         } else if (resolvable) {
@@ -526,7 +518,7 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
     };
     for (PathDriveMap::iterator it = candidates.begin(); it != candidates.end(); ++it) {
         CpuThreshold::doIteration();
-        if (!isValidPath(driveMap, fileSystems, 31, it->first.c_str(), false)) continue;
+        if (!isValidPath(driveMap, fileSystems, mdAllDrives, it->first.c_str(), false)) continue;
         PathInfo resolvedPath;
         PathInfo parentPath;
         if (!unix_path_resolver(it->second, resolvedPath, parentPath)) continue;
@@ -550,7 +542,7 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
     // Stage 3: what found no drive but still names a valid one.
     for (PathDrive& candidate : unresolvedCandidates) {
         const wchar_t* name = candidate.getPathName();
-        if (isValidPath(driveMap, fileSystems, 31, name, false) &&
+        if (isValidPath(driveMap, fileSystems, mdAllDrives, name, false) &&
             fileSystemPathChecker(name, includedDrivePaths, excludedDrivePaths))
             unresolved.push_back(candidate);
     }

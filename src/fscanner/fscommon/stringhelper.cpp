@@ -39,6 +39,11 @@ char* narrowName(const wchar_t* name) { return utils::myWcsToMbsString(name); }
 
 }  // namespace
 
+wchar_t* wideDuplicate(const wchar_t* text) {
+    if (text == nullptr) return nullptr;
+    return dupWide(text, std::wcslen(text));
+}
+
 wchar_t* wcsbtw(wchar_t* from, wchar_t* to, wchar_t c) {
     if (from == nullptr || to == nullptr || from > to) return nullptr;
     for (wchar_t* p = from; p <= to; ++p) {

@@ -65,6 +65,10 @@ wchar_t* wcstowlower(wchar_t* s);
 wchar_t* wcsupper(wchar_t* in, wchar_t* out);
 wchar_t* wcsupper(wchar_t* s);
 
+// New kelm_malloc copy of text (release with kelm_free); null for a null
+// text or a failed allocation.
+wchar_t* wideDuplicate(const wchar_t* text);
+
 // Copies src to *dst.  A null *dst gets a new kelm_malloc block; the block is
 // replaced only when src is longer than the text already in it, so a shorter
 // copy reuses the caller's block.  A null src (or dst) does nothing.

@@ -243,6 +243,19 @@ bool LinuxMmFile::size(unsigned int* result) {
 
 long LinuxMmFile::tell() { return static_cast<long>(position); }
 
+bool seekTarget(long offset, int origin, uint64_t position, uint64_t logical, long long* target) {
+    long long to;
+    switch (origin) {
+        case SEEK_FROM_START: to = offset; break;
+        case SEEK_FROM_CURRENT: to = static_cast<long long>(position) + offset; break;
+        case SEEK_FROM_END: to = static_cast<long long>(logical) + offset; break;
+        default: return false;
+    }
+    if (to < 0 || to > static_cast<long long>(logical)) return false;
+    *target = to;
+    return true;
+}
+
 bool LinuxMmFile::eof() { return eofFlag != 0; }
 
 bool LinuxMmFile::seek(long offset, int origin) {
@@ -250,13 +263,7 @@ bool LinuxMmFile::seek(long offset, int origin) {
     // Targets are computed wide so that no offset can wrap onto an accepted
     // position; every target outside 0..logical size is refused.
     long long target;
-    switch (origin) {
-        case SEEK_FROM_START: target = offset; break;
-        case SEEK_FROM_CURRENT: target = static_cast<long long>(position) + offset; break;
-        case SEEK_FROM_END: target = static_cast<long long>(logical) + offset; break;
-        default: return false;
-    }
-    if (target < 0 || target > static_cast<long long>(logical)) return false;
+    if (!seekTarget(offset, origin, position, logical, &target)) return false;
     position = static_cast<uint32_t>(target);
     return true;
 }

@@ -19,6 +19,11 @@ const int SEEK_FROM_START = 1;
 const int SEEK_FROM_CURRENT = 2;
 const int SEEK_FROM_END = 3;
 
+// The position seek(offset, origin) asks for on content of logical bytes read
+// at position, computed wide so that no offset can wrap onto an accepted
+// position.  False for an unknown origin or a target outside 0..logical.
+bool seekTarget(long offset, int origin, uint64_t position, uint64_t logical, long long* target);
+
 class AbstractFile {
 public:
     virtual ~AbstractFile() {}

@@ -11,6 +11,7 @@
 #include "fscanner/fscommon/codec.h"
 #include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/resolvepath.h"
+#include "fscanner/fscommon/stringhelper.h"
 #include "fscanner/fscommon/sysfactory.h"
 #include "fscanner/fscommon/table_format.h"
 #include "fscanner/fscommon/table_verify.h"
@@ -21,12 +22,28 @@ using namespace tableformat;
 
 namespace {
 
-wchar_t* wideDup(wchar_t const* text) {
-    if (text == nullptr) return nullptr;
-    size_t n = wcslen(text) + 1;
-    wchar_t* copy = static_cast<wchar_t*>(kelm_malloc(n * sizeof(wchar_t)));
-    if (copy != nullptr) std::memcpy(copy, text, n * sizeof(wchar_t));
-    return copy;
+// Closes and deletes file, if there is one, and leaves the pointer null.
+void closeAndDrop(AbstractFile*& file) {
+    if (file == nullptr) return;
+    file->close();
+    delete file;
+    file = nullptr;
+}
+
+// The first index of list whose name, as nameOf(index) gives it, is name;
+// taken out of list when remove.  Null for a null name or none.
+template <typename NameOf>
+Index* findIndex(std::vector<Index*>& list, NameOf nameOf, wchar_t const* name, bool remove) {
+    if (name == nullptr) return nullptr;
+    for (auto it = list.begin(); it != list.end(); ++it) {
+        wchar_t const* own = nameOf(*it);
+        if (own != nullptr && wcscmp(own, name) == 0) {
+            Index* found = *it;
+            if (remove) list.erase(it);
+            return found;
+        }
+    }
+    return nullptr;
 }
 
 // a + b (+ c) in a new kelm_malloc block; null when any part is null.
@@ -151,8 +168,8 @@ int hash(unsigned int value, int buckets) {
 Index::Index(wchar_t const* idxName, wchar_t const* dir, wchar_t const* fldName)
     : file(nullptr), indexName(nullptr), fieldName(nullptr), indexFileName(nullptr), fullPath(nullptr) {
     if (idxName == nullptr || dir == nullptr || fldName == nullptr) return;
-    indexName = wideDup(idxName);
-    fieldName = wideDup(fldName);
+    indexName = wideDuplicate(idxName);
+    fieldName = wideDuplicate(fldName);
     indexFileName = cachefiles::indexFileName(idxName);
     size_t dl = wcslen(dir);
     bool hasSeparator = dl > 0 && dir[dl - 1] == L'/';
@@ -168,10 +185,10 @@ Index::Index(wchar_t const* idxName, wchar_t const* dir, wchar_t const* fldName)
 
 Index::Index(const Index& other)
     : file(nullptr),
-      indexName(wideDup(other.indexName)),
-      fieldName(wideDup(other.fieldName)),
-      indexFileName(wideDup(other.indexFileName)),
-      fullPath(wideDup(other.fullPath)) {}
+      indexName(wideDuplicate(other.indexName)),
+      fieldName(wideDuplicate(other.fieldName)),
+      indexFileName(wideDuplicate(other.indexFileName)),
+      fullPath(wideDuplicate(other.fullPath)) {}
 
 Index::~Index() {
     close();
@@ -289,7 +306,7 @@ FS_Table::FS_Table(wchar_t const* tableName, wchar_t const* dir, bool compressed
     size_t rl = wcslen(real);
     directory = wideJoin(real, (rl > 0 && real[rl - 1] == L'/') ? L"" : L"/");
     kelm_free(real);
-    name = wideDup(tableName);
+    name = wideDuplicate(tableName);
     dataFileName = cachefiles::tableDataName(tableName);
     dataPath = wideJoin(directory, dataFileName);
     pointerPath = cachefiles::tablePointerPath(directory, tableName);
@@ -317,16 +334,8 @@ void FS_Table::freeNames() {
 
 FS_Table::~FS_Table() {
     freeHashIndexList(indexes);
-    if (dataFile != nullptr) {
-        dataFile->close();
-        delete dataFile;
-        dataFile = nullptr;
-    }
-    if (pointerFile != nullptr) {
-        pointerFile->close();
-        delete pointerFile;
-        pointerFile = nullptr;
-    }
+    closeAndDrop(dataFile);
+    closeAndDrop(pointerFile);
     freeNames();
     kelm_free(scratch);
     if (mutex != nullptr) {
@@ -447,16 +456,8 @@ bool FS_Table::open() {
 }
 
 bool FS_Table::close() {
-    if (dataFile != nullptr) {
-        dataFile->close();
-        delete dataFile;
-        dataFile = nullptr;
-    }
-    if (pointerFile != nullptr) {
-        pointerFile->close();
-        delete pointerFile;
-        pointerFile = nullptr;
-    }
+    closeAndDrop(dataFile);
+    closeAndDrop(pointerFile);
     freeHashIndexList(indexes);
     // A cursor never outlives the open table it walks.
     deleteRecordSets();
@@ -1259,27 +1260,13 @@ void FS_Table::freeHashIndexList(std::vector<Index*>& list) {
 }
 
 Index* FS_Table::searchHashIndexForIndexName(wchar_t const* indexName, bool removeFromList) {
-    if (indexName == nullptr) return nullptr;
-    for (auto it = indexes.begin(); it != indexes.end(); ++it) {
-        if ((*it)->getIndexName() != nullptr && wcscmp((*it)->getIndexName(), indexName) == 0) {
-            Index* found = *it;
-            if (removeFromList) indexes.erase(it);
-            return found;
-        }
-    }
-    return nullptr;
+    return findIndex(indexes, [](Index const* index) { return index->getIndexName(); }, indexName,
+                     removeFromList);
 }
 
 Index* FS_Table::searchHashIndexForFieldName(wchar_t const* fieldName, bool removeFromList) {
-    if (fieldName == nullptr) return nullptr;
-    for (auto it = indexes.begin(); it != indexes.end(); ++it) {
-        if ((*it)->getFieldName() != nullptr && wcscmp((*it)->getFieldName(), fieldName) == 0) {
-            Index* found = *it;
-            if (removeFromList) indexes.erase(it);
-            return found;
-        }
-    }
-    return nullptr;
+    return findIndex(indexes, [](Index const* index) { return index->getFieldName(); }, fieldName,
+                     removeFromList);
 }
 
 // ---- FS_Table: index building and lookup -------------------------------------
