@@ -10,6 +10,7 @@
 #include "fscanner/fscommon/fields.h"
 #include "fscanner/fscommon/filehash.h"
 #include "fscanner/fscommon/syntaxanalyzer.h"
+#include "fscanner/fscommon/syntaxfail.h"
 #include "fscanner/fscommon/wildcard.h"
 
 ExpValue::ExpValue()
@@ -185,14 +186,6 @@ bool checkSimpleExpression(wchar_t const* value, unsigned int relop, wchar_t con
             return false;
     }
 }
-
-// Sets the analyzer's failure flag, keeps its text, traces one line and
-// yields false.
-#define FS_SA_FAIL(...)                                                                 \
-    (error = true, noteError(QvLogWrapper::format(__VA_ARGS__)),                         \
-     trace != nullptr ? trace->traceMAX(__LINE__, __FILE__, __FUNCTION__, __VA_ARGS__)   \
-                      : (void)0,                                                         \
-     false)
 
 // ---------------------------------------------------------------- operators
 

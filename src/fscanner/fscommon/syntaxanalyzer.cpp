@@ -7,17 +7,8 @@
 
 #include "base/QvLogWrapper.h"
 #include "fscanner/fscommon/fields.h"
+#include "fscanner/fscommon/syntaxfail.h"
 #include "fscanner/fscommon/wildcard.h"
-
-// Sets the analyzer's failure flag, keeps its text and traces one line.
-#define FS_SA_FAIL(...)                                                              \
-    do {                                                                             \
-        error = true;                                                                \
-        noteError(QvLogWrapper::format(__VA_ARGS__));                                \
-        if (trace != nullptr) {                                                      \
-            trace->traceMAX(__LINE__, __FILE__, __FUNCTION__, __VA_ARGS__);          \
-        }                                                                            \
-    } while (0)
 
 // ---------------------------------------------------------------- Tree
 
