@@ -90,10 +90,7 @@ bool __recordSet::setCriteria(CriteriaEvaluator* criteria, bool caseSensitive) {
                 key = static_cast<wchar_t*>(kelm_malloc(128));
                 if (key != nullptr) wcs_itoa(static_cast<unsigned int>(info->getNumber()), key);
             } else if (info->getType() == EXP_STRING) {
-                wchar_t const* text = info->getStringValue();
-                size_t n = wcslen(text) + 1;
-                key = static_cast<wchar_t*>(kelm_malloc(n * sizeof(wchar_t)));
-                if (key != nullptr) std::memcpy(key, text, n * sizeof(wchar_t));
+                key = wideDuplicate(info->getStringValue());
             }
             if (key != nullptr) {
                 wcsupper(key);
