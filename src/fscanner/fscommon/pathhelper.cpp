@@ -59,6 +59,17 @@ int longestCovering(const wchar_t* path, std::vector<Entry>& list, bool caseSens
     return best;
 }
 
+// Traces every entry of one of the resolver's lists, named by what
+// ("resolved", "excluded", ...), on behalf of function.
+void traceResolverList(QvLogWrapper* log, const char* function, const char* what,
+                       const std::vector<PathDrive>& entries) {
+    for (const PathDrive& entry : entries)
+        log->traceMAX(__LINE__, __FILE__, function,
+                      "PathHelper::pathResolver - %s path ['%S'] [%d] ['%S']\n", what,
+                      safe(entry.getPathName()), static_cast<int>(entry.getDriveType()),
+                      safe(entry.getDriveName()));
+}
+
 }  // namespace
 
 // --- free functions -------------------------------------------------------
@@ -551,24 +562,10 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
     excluded.clear();
     if (log->istraceActive(4)) {
         log->traceMAX(__LINE__, __FILE__, __func__, "PathHelper::pathResolver - list info...\n");
-        for (const PathDrive& entry : resolved)
-            log->traceMAX(__LINE__, __FILE__, __func__, "PathHelper::pathResolver - resolved path ['%S'] [%d] ['%S']\n",
-                          safe(entry.getPathName()), static_cast<int>(entry.getDriveType()),
-                          safe(entry.getDriveName()));
-        for (const PathDrive& entry : parentResolved)
-            log->traceMAX(__LINE__, __FILE__, __func__,
-                          "PathHelper::pathResolver - parent resolved path ['%S'] [%d] ['%S']\n",
-                          safe(entry.getPathName()), static_cast<int>(entry.getDriveType()),
-                          safe(entry.getDriveName()));
-        for (const PathDrive& entry : excluded)
-            log->traceMAX(__LINE__, __FILE__, __func__, "PathHelper::pathResolver - excluded path ['%S'] [%d] ['%S']\n",
-                          safe(entry.getPathName()), static_cast<int>(entry.getDriveType()),
-                          safe(entry.getDriveName()));
-        for (const PathDrive& entry : unresolved)
-            log->traceMAX(__LINE__, __FILE__, __func__,
-                          "PathHelper::pathResolver - unresolved path ['%S'] [%d] ['%S']\n",
-                          safe(entry.getPathName()), static_cast<int>(entry.getDriveType()),
-                          safe(entry.getDriveName()));
+        traceResolverList(log, __func__, "resolved", resolved);
+        traceResolverList(log, __func__, "parent resolved", parentResolved);
+        traceResolverList(log, __func__, "excluded", excluded);
+        traceResolverList(log, __func__, "unresolved", unresolved);
         log->traceMAX(__LINE__, __FILE__, __func__, "PathHelper::pathResolver - list info end\n");
     }
     return 1;
