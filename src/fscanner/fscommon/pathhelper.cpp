@@ -3,6 +3,7 @@
 #include <errno.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <climits>
 #include <cstdlib>
 #include <cstring>
@@ -57,6 +58,11 @@ int longestCovering(const wchar_t* path, std::vector<Entry>& list, bool caseSens
         }
     }
     return best;
+}
+
+// True when list holds an entry equal to path.
+bool holds(const std::vector<PathInfo>& list, const PathInfo& path) {
+    return std::find(list.begin(), list.end(), path) != list.end();
 }
 
 // Traces every entry of one of the resolver's lists, named by what
@@ -245,14 +251,7 @@ bool PathHelper::removePathListDuplicate(std::vector<PathInfo>& list) {
 void PathHelper::differencePathList(std::vector<PathInfo>& a, std::vector<PathInfo>& b,
                                     std::vector<PathInfo>& out) {
     for (const PathInfo& entry : a) {
-        bool found = false;
-        for (const PathInfo& other : b) {
-            if (entry == other) {
-                found = true;
-                break;
-            }
-        }
-        if (!found) out.push_back(entry);
+        if (!holds(b, entry)) out.push_back(entry);
     }
 }
 
@@ -273,16 +272,7 @@ void PathHelper::buildPathList(std::vector<DriveInfo>& drives, std::vector<PathI
 void PathHelper::appendPathList(std::vector<PathInfo>& src, std::vector<PathInfo>& dst, bool unique) {
     removePathListDuplicate(dst);
     for (const PathInfo& entry : src) {
-        if (unique) {
-            bool found = false;
-            for (const PathInfo& other : dst) {
-                if (entry == other) {
-                    found = true;
-                    break;
-                }
-            }
-            if (found) continue;
-        }
+        if (unique && holds(dst, entry)) continue;
         dst.push_back(entry);
     }
 }
@@ -752,14 +742,7 @@ void PathHelper::fillExclude(PathDrive& root, std::vector<PathDrive>& excludes, 
             out.push_back(pathInfo);
         } else if (length > 1 && path[0] == L'*') {
             // No fixed part: it applies below any root, once.
-            bool present = false;
-            for (const PathInfo& other : out) {
-                if (other == pathInfo) {
-                    present = true;
-                    break;
-                }
-            }
-            if (!present) out.push_back(pathInfo);
+            if (!holds(out, pathInfo)) out.push_back(pathInfo);
         }
     }
 }
