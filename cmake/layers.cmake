@@ -43,7 +43,7 @@ set(FSCANNER_LAYER_text
 # layer: values run commands of the analyzer), criteria, known-hash sets.
 set(FSCANNER_LAYER_language
   fscanner/fscommon/lexer fscanner/fscommon/expvalue
-  fscanner/fscommon/syntaxanalyzer fscanner/fscommon/criteria
+  fscanner/fscommon/syntaxanalyzer fscanner/fscommon/syntaxfail fscanner/fscommon/criteria
   fscanner/fscommon/filehash)
 
 # The record store: table files, indexes, cursors, compaction, the natural

@@ -10,19 +10,11 @@
 #include "base/kelmem.h"
 #include "fscanner/fscommon/env.h"
 #include "fscanner/fscommon/expvalue.h"
+#include "fscanner/fscommon/stringhelper.h"
 #include "fscanner/fscommon/utils.h"
 #include "fscanner/fscommon/wildcard.h"
 
 namespace {
-
-// kelm_malloc copy of a wide string; null for null or a failed allocation.
-wchar_t* kelmDuplicate(const wchar_t* value) {
-    if (value == nullptr) return nullptr;
-    size_t n = wcslen(value) + 1;
-    wchar_t* copy = static_cast<wchar_t*>(kelm_malloc(n * sizeof(wchar_t)));
-    if (copy != nullptr) wmemcpy(copy, value, n);
-    return copy;
-}
 
 bool sameText(const wchar_t* a, const wchar_t* b) {
     if (a == nullptr || b == nullptr) return a == b;
@@ -296,7 +288,7 @@ PathInfo::PathInfo(const wchar_t* name, bool isRecursive)
     : pathName(name != nullptr ? wcsdup(name) : nullptr), recursive(isRecursive) {}
 
 PathInfo::PathInfo(const PathInfo& other)
-    : pathName(kelmDuplicate(other.pathName)), recursive(other.recursive) {}
+    : pathName(wideDuplicate(other.pathName)), recursive(other.recursive) {}
 
 PathInfo& PathInfo::operator=(const PathInfo& other) {
     setPathInfo(other);
@@ -307,7 +299,7 @@ PathInfo::~PathInfo() { kelm_free(pathName); }
 
 void PathInfo::setPathInfo(const PathInfo& other) {
     if (this == &other) return;
-    wchar_t* copy = kelmDuplicate(other.pathName);
+    wchar_t* copy = wideDuplicate(other.pathName);
     kelm_free(pathName);
     pathName = copy;
     recursive = other.recursive;
@@ -330,16 +322,16 @@ DriveInfo::DriveInfo()
     : driveName(nullptr), driveFileSystem(nullptr), driveType(dtUnknown), excludedDrive(false) {}
 
 DriveInfo::DriveInfo(const wchar_t* name, DriveType type, const wchar_t* fileSystem)
-    : driveName(kelmDuplicate(name)),
-      driveFileSystem(kelmDuplicate(fileSystem)),
+    : driveName(wideDuplicate(name)),
+      driveFileSystem(wideDuplicate(fileSystem)),
       driveType(type),
       excludedDrive(false) {}
 
 // The source is expected to carry both strings; a missing one is copied as
 // null rather than read.
 DriveInfo::DriveInfo(const DriveInfo& other)
-    : driveName(kelmDuplicate(other.driveName)),
-      driveFileSystem(kelmDuplicate(other.driveFileSystem)),
+    : driveName(wideDuplicate(other.driveName)),
+      driveFileSystem(wideDuplicate(other.driveFileSystem)),
       driveType(other.driveType),
       excludedDrive(other.excludedDrive) {}
 
@@ -362,8 +354,8 @@ void DriveInfo::setDriveInfo(const DriveInfo& other) {
     if (other.driveName == nullptr || other.driveFileSystem == nullptr) {
         releaseStrings();
     } else {
-        wchar_t* name = kelmDuplicate(other.driveName);
-        wchar_t* fileSystem = kelmDuplicate(other.driveFileSystem);
+        wchar_t* name = wideDuplicate(other.driveName);
+        wchar_t* fileSystem = wideDuplicate(other.driveFileSystem);
         releaseStrings();
         driveName = name;
         driveFileSystem = fileSystem;
@@ -412,10 +404,10 @@ bool PathDrive::operator==(const PathDrive& other) const {
 
 FileSystemInfo::FileSystemInfo() : fileSystemName(nullptr) {}
 
-FileSystemInfo::FileSystemInfo(const wchar_t* name) : fileSystemName(kelmDuplicate(name)) {}
+FileSystemInfo::FileSystemInfo(const wchar_t* name) : fileSystemName(wideDuplicate(name)) {}
 
 FileSystemInfo::FileSystemInfo(const FileSystemInfo& other)
-    : fileSystemName(kelmDuplicate(other.fileSystemName)) {}
+    : fileSystemName(wideDuplicate(other.fileSystemName)) {}
 
 FileSystemInfo& FileSystemInfo::operator=(const FileSystemInfo& other) {
     setFileSystemInfo(other);
@@ -426,7 +418,7 @@ FileSystemInfo::~FileSystemInfo() { kelm_free(fileSystemName); }
 
 void FileSystemInfo::setFileSystemInfo(const FileSystemInfo& other) {
     if (this == &other) return;
-    wchar_t* copy = kelmDuplicate(other.fileSystemName);
+    wchar_t* copy = wideDuplicate(other.fileSystemName);
     kelm_free(fileSystemName);
     fileSystemName = copy;
 }

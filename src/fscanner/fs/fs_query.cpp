@@ -6,6 +6,7 @@
 #include "base/QvLogWrapper.h"
 #include "base/kelmem.h"
 #include "fscanner/fscommon/mountlist.h"
+#include "fscanner/fscommon/stringhelper.h"
 #include "fscanner/fscommon/utils.h"
 #include "fscanner/fscommon/wildcard.h"
 
@@ -55,10 +56,8 @@ int FsQuery::addRemoteFileSystem(const char* fileSystem) {
 
 int FsQuery::setQuery(const wchar_t* query) {
     if (query == nullptr) return 0;
-    size_t n = wcslen(query) + 1;
-    wchar_t* copy = static_cast<wchar_t*>(kelm_malloc(n * sizeof(wchar_t)));
+    wchar_t* copy = wideDuplicate(query);
     if (copy == nullptr) return 0;
-    wmemcpy(copy, query, n);
     kelm_free(data->query);
     data->query = copy;
     return 1;

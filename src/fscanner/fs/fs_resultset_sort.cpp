@@ -1198,6 +1198,15 @@ bool comparePassRecords(void* a, void* b, unsigned int op, bool flag) {
     return checkSimpleExpression(x->key, op, y->key, flag);
 }
 
+// The record callbacks of the merge passes for one sort key.
+template <unsigned int Key>
+bool keyCallbacks(resultsort::PassCallbacks& callbacks) {
+    callbacks.compare = comparePassRecords<Key>;
+    callbacks.read = readPassRecord<Key>;
+    callbacks.peek = peekPassRecord<Key>;
+    return true;
+}
+
 }  // namespace
 
 namespace resultsort {
@@ -1212,25 +1221,13 @@ bool passCallbacks(unsigned int key, PassCallbacks& callbacks) {
     callbacks.free = freePassRecord;
     switch (key) {
         case FsFileInfo::COMPARE_PATH:
-            callbacks.compare = comparePassRecords<FsFileInfo::COMPARE_PATH>;
-            callbacks.read = readPassRecord<FsFileInfo::COMPARE_PATH>;
-            callbacks.peek = peekPassRecord<FsFileInfo::COMPARE_PATH>;
-            return true;
+            return keyCallbacks<FsFileInfo::COMPARE_PATH>(callbacks);
         case FsFileInfo::COMPARE_NAME:
-            callbacks.compare = comparePassRecords<FsFileInfo::COMPARE_NAME>;
-            callbacks.read = readPassRecord<FsFileInfo::COMPARE_NAME>;
-            callbacks.peek = peekPassRecord<FsFileInfo::COMPARE_NAME>;
-            return true;
+            return keyCallbacks<FsFileInfo::COMPARE_NAME>(callbacks);
         case FsFileInfo::COMPARE_FULL_PATH:
-            callbacks.compare = comparePassRecords<FsFileInfo::COMPARE_FULL_PATH>;
-            callbacks.read = readPassRecord<FsFileInfo::COMPARE_FULL_PATH>;
-            callbacks.peek = peekPassRecord<FsFileInfo::COMPARE_FULL_PATH>;
-            return true;
+            return keyCallbacks<FsFileInfo::COMPARE_FULL_PATH>(callbacks);
         case FsFileInfo::COMPARE_SIZE:
-            callbacks.compare = comparePassRecords<FsFileInfo::COMPARE_SIZE>;
-            callbacks.read = readPassRecord<FsFileInfo::COMPARE_SIZE>;
-            callbacks.peek = peekPassRecord<FsFileInfo::COMPARE_SIZE>;
-            return true;
+            return keyCallbacks<FsFileInfo::COMPARE_SIZE>(callbacks);
         default:
             return false;
     }

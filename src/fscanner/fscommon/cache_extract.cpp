@@ -22,6 +22,7 @@
 #include "fscanner/fscommon/filehash.h"
 #include "fscanner/fscommon/pathhelper.h"
 #include "fscanner/fscommon/recordset.h"
+#include "fscanner/fscommon/trace.h"
 #include "fscanner/fscommon/utils.h"
 #include "fscanner/fscommon/wildcard.h"
 
@@ -90,8 +91,7 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
                                  int timeoutMs)
 {
     if (includes.empty()) {
-        log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - no included paths specified!",
-                      className, __func__);
+        FS_TRACE(log, MID, "no included paths specified!");
         return SUCCESS;
     }
 
@@ -140,8 +140,7 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
         // the extraction, and is checked before every matching row.
         unsigned int passed = utils::getTickCount() - start;
         if (static_cast<long long>(timeoutMs) - static_cast<long long>(passed) <= 0) {
-            log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - timed out!", className,
-                          __func__);
+            FS_TRACE(log, MIN, "timed out!");
             return SCAN_TIMED_OUT;
         }
 
@@ -150,25 +149,20 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
             // The throttle holds the query's share of the CPU here, once per
             // directory: a row costs nothing beyond the time check.
             CpuThreshold::doIteration();
-            log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s bIncludeFile=false", className,
-                          __func__);
+            FS_TRACE_AS(log, MAX, "%s::%s bIncludeFile=false");
             if (!findPathById(directories, pathId, directoryPath, EXTRACT_PATH_CHARS)) {
-                log->traceMIN(__LINE__, __FILE__, __func__,
-                              "%s::%s - findPathById() failed! extract interrupted!", className,
-                              __func__);
+                FS_TRACE(log, MIN, "findPathById() failed! extract interrupted!");
                 return CACHE_UNUSABLE;
             }
-            log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s for path: '%S'", className,
-                          __func__, directoryPath);
+            FS_TRACE_AS(log, MAX, "%s::%s for path: '%S'", directoryPath);
             lastDirectoryId = pathId;
 
             int index = checkPathDriveListEx(directoryPath, roots, mdLocalDriveGroup, caseSensitive);
             if (index != lastRootIndex) {
                 state.rootExcludes.clear();
                 if (index != -1) {
-                    log->traceMAX(__LINE__, __FILE__, __func__,
-                                  "%s::%s building excludeList for pathIndex=%d for: '%S'",
-                                  className, __func__, index, directoryPath);
+                    FS_TRACE_AS(log, MAX, "%s::%s building excludeList for pathIndex=%d for: '%S'",
+                                index, directoryPath);
                     pathHelper.buildExcludeList(drives, roots[index], state.rootExcludes);
                 }
             }
@@ -188,8 +182,7 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
                 included = false;
 
             if (included) {
-                log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s PATH INCLUDED: '%S'",
-                              className, __func__, directoryPath);
+                FS_TRACE_AS(log, MAX, "%s::%s PATH INCLUDED: '%S'", directoryPath);
                 // directoryPath is shorter than EXTRACT_PATH_CHARS - 4: the
                 // rebuild refuses anything longer.
                 size_t len = wcslen(directoryPath);
@@ -201,8 +194,7 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
                 }
                 includeFile = true;
             } else {
-                log->traceMAX(__LINE__, __FILE__, __func__, "%s::%s PATH NOT included: '%S'",
-                              className, __func__, directoryPath);
+                FS_TRACE_AS(log, MAX, "%s::%s PATH NOT included: '%S'", directoryPath);
                 includeFile = false;
             }
             lastRootIndex = index;

@@ -30,6 +30,7 @@
 #include "fscanner/fscommon/fsbuild.h"
 #include "fscanner/fscommon/pathhelper.h"
 #include "fscanner/fscommon/recordset.h"
+#include "fscanner/fscommon/trace.h"
 #include "fscanner/fscommon/utils.h"
 #include "fscanner/fscommon/walk.h"
 #include "fscanner/fscommon/wildcard.h"
@@ -72,22 +73,18 @@ public:
         wchar_t const* pathName = directory.pathName;
         switch (why) {
         case WalkSkip::TimedOut:
-            log_->traceMID(__LINE__, __FILE__, "scan", "%s::%s - fs scanning timed out (timeout)",
-                           className_, "scan");
+            FS_TRACE_FOR(log_, MID, className_, "scan", "fs scanning timed out (timeout)");
             break;
         case WalkSkip::PathTooLong:
-            log_->traceMID(__LINE__, __FILE__, "scan", "%s::%s - '%S' path too long", className_,
-                           "scan", pathName);
+            FS_TRACE_FOR(log_, MID, className_, "scan", "'%S' path too long", pathName);
             statistics_.addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, pathName, 0);
             break;
         case WalkSkip::OutOfMemory:
-            log_->traceMIN(__LINE__, __FILE__, "scan", "%s::%s - out of memory for '%S'", className_,
-                           "scan", pathName);
+            FS_TRACE_FOR(log_, MIN, className_, "scan", "out of memory for '%S'", pathName);
             break;
         case WalkSkip::NotConvertible:
         case WalkSkip::ConvertedTooLong:
-            log_->traceMID(__LINE__, __FILE__, "scan", "%s::%s - '%S' path can't be converted",
-                           className_, "scan", pathName);
+            FS_TRACE_FOR(log_, MID, className_, "scan", "'%S' path can't be converted", pathName);
             statistics_.addSkipped(why == WalkSkip::NotConvertible
                                        ? FsQueryStatistics::SKIP_UNDECODABLE_NAME
                                        : FsQueryStatistics::SKIP_PATH_TOO_LONG,
@@ -96,8 +93,8 @@ public:
         case WalkSkip::Unreadable:
             // The throttle counts every attempt to read a directory.
             CpuThreshold::doIteration();
-            log_->traceMID(__LINE__, __FILE__, "scan", "%s::%s - scandir error opening '%s' path!",
-                           className_, "scan", directory.narrowPath->c_str());
+            FS_TRACE_FOR(log_, MID, className_, "scan", "scandir error opening '%s' path!",
+                         directory.narrowPath->c_str());
             statistics_.addSkipped(FsQueryStatistics::SKIP_UNREADABLE_DIRECTORY,
                                    directory.narrowPath->c_str(), nullptr, error);
             break;
@@ -117,11 +114,9 @@ public:
         }
         if (logDepthOf(directory) >= 1) {
             logFolderName(cache_.folderLog, narrow);
-            log_->traceMID(__LINE__, __FILE__, "scan", "%s::%s - scanning %s dir", className_, "scan",
-                           narrow);
+            FS_TRACE_FOR(log_, MID, className_, "scan", "scanning %s dir", narrow);
         } else {
-            log_->traceMAX(__LINE__, __FILE__, "scan", "%s::%s - scanning %s dir", className_, "scan",
-                           narrow);
+            FS_TRACE_FOR(log_, MAX, className_, "scan", "scanning %s dir", narrow);
         }
     }
 
@@ -145,8 +140,7 @@ public:
     {
         if (why != WalkSkip::Undecodable)
             return;
-        log_->traceMID(__LINE__, __FILE__, "scan", "%s::%s - file name len is 0. file skipped!",
-                       className_, "scan");
+        FS_TRACE_FOR(log_, MID, className_, "scan", "file name len is 0. file skipped!");
         statistics_.addSkipped(FsQueryStatistics::SKIP_UNDECODABLE_NAME,
                                directory.narrowPath->c_str(), entry.name, 0);
     }
@@ -187,15 +181,13 @@ public:
         if (entry.dot || (attr & FsFileInfo::ATTR_SYMLINK) != 0 || !directory.path->getRecursive())
             return visit;
         if (directory.prefixLength + entry.nameLength > DirectoryWalker::kMaxPath) {
-            log_->traceMID(__LINE__, __FILE__, "scan", "%s::%s - '%S' path too long!", className_,
-                           "scan", entry.wideName);
+            FS_TRACE_FOR(log_, MID, className_, "scan", "'%S' path too long!", entry.wideName);
             statistics_.addSkipped(FsQueryStatistics::SKIP_PATH_TOO_LONG, directoryBytes.c_str(),
                                    entry.name, 0);
             return visit;
         }
         if (!excludes_.empty() && checkPathList(entry.fullPath, excludes_, caseSensitive_, true)) {
-            log_->traceMID(__LINE__, __FILE__, "scan", "%s::%s - path '%S' excluded!", className_,
-                           "scan", entry.fullPath);
+            FS_TRACE_FOR(log_, MID, className_, "scan", "path '%S' excluded!", entry.fullPath);
             return visit;
         }
         // Written even when this directory's own files were not counted.
@@ -217,8 +209,8 @@ public:
     {
         if (!directory.listed)
             return;
-        log_->traceMAX(__LINE__, __FILE__, "scan", "%s::%s - exit. [retValue is %d] [deep %d]",
-                       className_, "scan", result, logDepthOf(directory));
+        FS_TRACE_FOR(log_, MAX, className_, "scan", "exit. [retValue is %d] [deep %d]", result,
+                     logDepthOf(directory));
     }
 
 private:
@@ -295,7 +287,7 @@ int FS_CacheBase::build(FsQuery const& query, PathDrive& root, RecordSet& direct
                         std::vector<PathInfo>& includes, std::vector<PathInfo>& excludes,
                         bool caseSensitive, int timeoutMs)
 {
-    log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - entry.", className, __func__);
+    FS_TRACE(log, MID, "entry.");
     int logDepth = getNestedFolderDepthForLogging();
     wchar_t const* rootPath = root.getPathName();
     if (rootPath == nullptr || rootPath[0] == L'\0')
@@ -334,8 +326,7 @@ int FS_CacheBase::build(FsQuery const& query, PathDrive& root, RecordSet& direct
         parentId = directoriesIndex;
     }
 
-    log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - scan %S dir", className, __func__,
-                  rootPath);
+    FS_TRACE(log, MID, "scan %S dir", rootPath);
     std::vector<wchar_t> rootCopy(rootPath, rootPath + wcslen(rootPath) + 1);
     if (!findPathByName(directories, directories2, rootCopy.data(), caseSensitive))
         return 0;
@@ -344,14 +335,11 @@ int FS_CacheBase::build(FsQuery const& query, PathDrive& root, RecordSet& direct
     directories.update();
 
     if (!excludes.empty() && checkPathList(rootPath, excludes, caseSensitive, root.getRecursive())) {
-        log->traceMID(__LINE__, __FILE__, __func__, "%s::%s - path '%S' excluded!", className,
-                      __func__, rootPath);
+        FS_TRACE(log, MID, "path '%S' excluded!", rootPath);
         return 0;
     }
     if (!fs_isValidPath(rootCopy.data())) {
-        log->traceMID(__LINE__, __FILE__, __func__,
-                      "%s::%s - '%S' is a symbolic link or is not a directory!", className, __func__,
-                      rootPath);
+        FS_TRACE(log, MID, "'%S' is a symbolic link or is not a directory!", rootPath);
         return 0;
     }
     // The counter's value is the root's id here: the root row was either just

@@ -17,6 +17,7 @@
 #include "fscanner/fscommon/stringhelper.h"
 #include "fscanner/fscommon/wildcard.h"
 #include "fscanner/fscommon/table.h"
+#include "fscanner/fscommon/trace.h"
 
 namespace cachetables {
 wchar_t const* const directoryColumns[DIRECTORY_COLUMNS] = {L"ID", L"PATHNAME", L"PARENTID",
@@ -200,16 +201,14 @@ bool FS_CacheBase::buildLookups()
     for (int i = 0; i < 10; ++i) {
         if (!defaultVariables->add(cachetables::variableNames[i], cachetables::variableTypes[i]) ||
             (variableHandles[i] = defaultVariables->name(cachetables::variableNames[i])) == nullptr) {
-            log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - defaultVariables error!", className,
-                          __func__);
+            FS_TRACE(log, MIN, "defaultVariables error!");
             return false;
         }
     }
     for (int i = 0; i < 7; ++i) {
         criteria[i] = new CriteriaEvaluator(cachetables::criteriaTexts[i]);
         if (!criteria[i]->setVariables(defaultVariables)) {
-            log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - criteriaEvaluator creation error!",
-                          className, __func__);
+            FS_TRACE(log, MIN, "criteriaEvaluator creation error!");
             return false;
         }
     }
@@ -409,8 +408,7 @@ void FS_CacheBase::removeFiles(FS_Table* files, unsigned int pathId)
          row; row = set.moveNext())
         set.remove();
     if (!files->closeRecordSet(set))
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - closeRecordSet failed!", className,
-                      __func__);
+        FS_TRACE(log, MIN, "closeRecordSet failed!");
 }
 
 void FS_CacheBase::removeTree(FS_Table* directories, FS_Table* files, unsigned int id)
@@ -432,8 +430,7 @@ void FS_CacheBase::removeTree(FS_Table* directories, FS_Table* files, unsigned i
     if (lookUp(set, cachetables::CRIT_ID, L"ID", cachetables::VAR_ID, id, nullptr, true))
         set.remove();
     if (!directories->closeRecordSet(set))
-        log->traceMIN(__LINE__, __FILE__, __func__, "%s::%s - closeRecordSet failed!", className,
-                      __func__);
+        FS_TRACE(log, MIN, "closeRecordSet failed!");
 }
 
 // ----------------------------------------------------------- query functions

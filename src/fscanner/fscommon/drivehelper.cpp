@@ -25,29 +25,26 @@ std::string& automounterMasterPath() {
     return path;
 }
 
-// Wide form of a narrow text by mbstowcs; false when it can't be converted.
-bool toWide(const char* text, std::wstring& out) {
+// text converted by convert (mbstowcs or wcstombs: measured first, then
+// written); false, out empty, for a null text or one that can't be converted.
+template <class From, class To>
+bool convertText(const From* text, std::basic_string<To>& out,
+                 size_t (*convert)(To*, const From*, size_t)) {
     out.clear();
     if (!text) return false;
-    size_t length = mbstowcs(nullptr, text, 0);
+    size_t length = convert(nullptr, text, 0);
     if (length == static_cast<size_t>(-1)) return false;
-    std::vector<wchar_t> buffer(length + 1, L'\0');
-    if (mbstowcs(buffer.data(), text, length + 1) == static_cast<size_t>(-1)) return false;
+    std::vector<To> buffer(length + 1, To());
+    if (convert(buffer.data(), text, length + 1) == static_cast<size_t>(-1)) return false;
     out.assign(buffer.data(), length);
     return true;
 }
 
+// Wide form of a narrow text by mbstowcs; false when it can't be converted.
+bool toWide(const char* text, std::wstring& out) { return convertText(text, out, mbstowcs); }
+
 // Narrow form of a wide text by wcstombs; false when it can't be converted.
-bool toNarrow(const wchar_t* text, std::string& out) {
-    out.clear();
-    if (!text) return false;
-    size_t length = wcstombs(nullptr, text, 0);
-    if (length == static_cast<size_t>(-1)) return false;
-    std::vector<char> buffer(length + 1, '\0');
-    if (wcstombs(buffer.data(), text, length + 1) == static_cast<size_t>(-1)) return false;
-    out.assign(buffer.data(), length);
-    return true;
-}
+bool toNarrow(const wchar_t* text, std::string& out) { return convertText(text, out, wcstombs); }
 
 bool isHostsDirectory(const char* dir) {
     return dir && (strcmp(dir, "/net") == 0 || strcmp(dir, "/smb") == 0);

@@ -2,6 +2,7 @@
 
 #include <cwchar>
 
+#include <algorithm>
 #include <climits>
 #include <memory>
 
@@ -10,6 +11,7 @@
 #include "fscanner/fscommon/fields.h"
 #include "fscanner/fscommon/filehash.h"
 #include "fscanner/fscommon/syntaxanalyzer.h"
+#include "fscanner/fscommon/syntaxfail.h"
 #include "fscanner/fscommon/wildcard.h"
 
 ExpValue::ExpValue()
@@ -120,8 +122,9 @@ bool resetExpValue(char type, ExpValue& value) {
 
 namespace {
 
+// value relop other for relop 0..5 (== >= <= > < !=); false for any other.
 template <typename T>
-bool compareUnsigned(T value, unsigned int relop, T other) {
+bool compareValues(T value, unsigned int relop, T other) {
     switch (relop) {
         case 0:
             return value == other;
@@ -143,24 +146,24 @@ bool compareUnsigned(T value, unsigned int relop, T other) {
 }  // namespace
 
 bool checkSimpleExpression(unsigned char value, unsigned int relop, unsigned char other) {
-    return compareUnsigned(value, relop, other);
+    return compareValues(value, relop, other);
 }
 
 bool checkSimpleExpression(unsigned short value, unsigned int relop, unsigned short other) {
-    return compareUnsigned(value, relop, other);
+    return compareValues(value, relop, other);
 }
 
 bool checkSimpleExpression(unsigned int value, unsigned int relop, unsigned int other) {
-    return compareUnsigned(value, relop, other);
+    return compareValues(value, relop, other);
 }
 
 bool checkSimpleExpression(unsigned long long value, unsigned int relop,
                            unsigned long long other) {
-    return compareUnsigned(value, relop, other);
+    return compareValues(value, relop, other);
 }
 
 bool checkSimpleExpression(unsigned long value, unsigned int relop, unsigned long other) {
-    return compareUnsigned(value, relop, other);
+    return compareValues(value, relop, other);
 }
 
 bool checkSimpleExpression(wchar_t const* value, unsigned int relop, wchar_t const* other,
@@ -173,26 +176,11 @@ bool checkSimpleExpression(wchar_t const* value, unsigned int relop, wchar_t con
             return wildvccmp(other, value, caseSensitive);
         case 5:
             return !wildvccmp(other, value, caseSensitive);
-        case 1:
-            return wcsvccmp(value, other, caseSensitive) >= 0;
-        case 2:
-            return wcsvccmp(value, other, caseSensitive) <= 0;
-        case 3:
-            return wcsvccmp(value, other, caseSensitive) > 0;
-        case 4:
-            return wcsvccmp(value, other, caseSensitive) < 0;
         default:
-            return false;
+            // The orders (1..4) compare the texts; any other relop holds never.
+            return relop < 5 && compareValues(wcsvccmp(value, other, caseSensitive), relop, 0);
     }
 }
-
-// Sets the analyzer's failure flag, keeps its text, traces one line and
-// yields false.
-#define FS_SA_FAIL(...)                                                                 \
-    (error = true, noteError(QvLogWrapper::format(__VA_ARGS__)),                         \
-     trace != nullptr ? trace->traceMAX(__LINE__, __FILE__, __FUNCTION__, __VA_ARGS__)   \
-                      : (void)0,                                                         \
-     false)
 
 // ---------------------------------------------------------------- operators
 
@@ -234,24 +222,8 @@ bool expArithmetic(unsigned int op, unsigned long long left, unsigned long long 
 }
 
 bool expCompareNumbers(unsigned int relop, unsigned long long left, unsigned long long right) {
-    long long l = static_cast<long long>(left);
-    long long r = static_cast<long long>(right);
-    switch (relop) {
-        case 0:
-            return l == r;
-        case 1:
-            return l >= r;
-        case 2:
-            return l <= r;
-        case 3:
-            return l > r;
-        case 4:
-            return l < r;
-        case 5:
-            return l != r;
-        default:
-            return false;
-    }
+    // Numbers of the language compare signed.
+    return compareValues(static_cast<long long>(left), relop, static_cast<long long>(right));
 }
 
 namespace {
@@ -275,16 +247,11 @@ bool expCompareStrings(unsigned int relop, ExpValue const& left, ExpValue const&
             return stringsEqual(left, right, caseSensitive);
         case 5:
             return !stringsEqual(left, right, caseSensitive);
-        case 1:
-            return wcsvccmp(left.getStringValue(), right.getStringValue(), caseSensitive) >= 0;
-        case 2:
-            return wcsvccmp(left.getStringValue(), right.getStringValue(), caseSensitive) <= 0;
-        case 3:
-            return wcsvccmp(left.getStringValue(), right.getStringValue(), caseSensitive) > 0;
-        case 4:
-            return wcsvccmp(left.getStringValue(), right.getStringValue(), caseSensitive) < 0;
         default:
-            return false;
+            // The orders (1..4) compare the texts; any other relop holds never.
+            return relop < 5 && compareValues(wcsvccmp(left.getStringValue(),
+                                                       right.getStringValue(), caseSensitive),
+                                              relop, 0);
     }
 }
 
@@ -324,6 +291,39 @@ bool sameSignature(CmdToken const& entry, wchar_t const* name, std::vector<char>
     return wcscmp(entry.name, name) == 0 && entry.argumentTypes == types;
 }
 
+// Enters command (entry holds the pointer) under name with these argument
+// types into the process-wide table; false when that signature is there.
+bool addCommand(wchar_t const* name, char returnType, std::vector<char> const& types,
+                CmdToken& entry) {
+    std::vector<CmdToken>& table = cmdTokenTable();
+    for (CmdToken const& known : table) {
+        if (sameSignature(known, name, types)) {
+            return false;
+        }
+    }
+    wcscpy(entry.name, name);
+    entry.argumentCount = static_cast<unsigned char>(types.size());
+    entry.returnType = returnType;
+    entry.argumentTypes = types;
+    table.push_back(entry);
+    return true;
+}
+
+// True when the table has a command of this name whose argument types begin
+// with types.
+bool hasCommand(wchar_t const* name, std::vector<char> const& types) {
+    if (name == nullptr) {
+        return false;
+    }
+    for (CmdToken const& entry : cmdTokenTable()) {
+        if (wcscmp(entry.name, name) == 0 && entry.argumentTypes.size() >= types.size() &&
+            std::equal(types.begin(), types.end(), entry.argumentTypes.begin())) {
+            return true;
+        }
+    }
+    return false;
+}
+
 }  // namespace
 
 bool SyntaxAnalyzer::addCmdToken(wchar_t const* name, char returnType, char argumentType,
@@ -332,21 +332,9 @@ bool SyntaxAnalyzer::addCmdToken(wchar_t const* name, char returnType, char argu
         !validType(argumentType)) {
         return false;
     }
-    std::vector<char> types(1, argumentType);
-    std::vector<CmdToken>& table = cmdTokenTable();
-    for (CmdToken const& entry : table) {
-        if (sameSignature(entry, name, types)) {
-            return false;
-        }
-    }
     CmdToken entry;
-    wcscpy(entry.name, name);
-    entry.argumentCount = 1;
-    entry.returnType = returnType;
-    entry.argumentTypes = types;
     entry.command.unary = command;
-    table.push_back(entry);
-    return true;
+    return addCommand(name, returnType, std::vector<char>{argumentType}, entry);
 }
 
 bool SyntaxAnalyzer::addCmdToken(wchar_t const* name, char returnType, char firstType,
@@ -358,46 +346,17 @@ bool SyntaxAnalyzer::addCmdToken(wchar_t const* name, char returnType, char firs
     std::vector<char> types;
     types.push_back(firstType);
     types.push_back(secondType);
-    std::vector<CmdToken>& table = cmdTokenTable();
-    for (CmdToken const& entry : table) {
-        if (sameSignature(entry, name, types)) {
-            return false;
-        }
-    }
     CmdToken entry;
-    wcscpy(entry.name, name);
-    entry.argumentCount = 2;
-    entry.returnType = returnType;
-    entry.argumentTypes = types;
     entry.command.binary = command;
-    table.push_back(entry);
-    return true;
+    return addCommand(name, returnType, types, entry);
 }
 
 bool SyntaxAnalyzer::findCmdToken(wchar_t const* name, char argumentType) {
-    if (name == nullptr) {
-        return false;
-    }
-    for (CmdToken const& entry : cmdTokenTable()) {
-        if (wcscmp(entry.name, name) == 0 && !entry.argumentTypes.empty() &&
-            entry.argumentTypes[0] == argumentType) {
-            return true;
-        }
-    }
-    return false;
+    return hasCommand(name, std::vector<char>{argumentType});
 }
 
 bool SyntaxAnalyzer::findCmdToken(wchar_t const* name, char firstType, char secondType) {
-    if (name == nullptr) {
-        return false;
-    }
-    for (CmdToken const& entry : cmdTokenTable()) {
-        if (wcscmp(entry.name, name) == 0 && entry.argumentTypes.size() >= 2 &&
-            entry.argumentTypes[0] == firstType && entry.argumentTypes[1] == secondType) {
-            return true;
-        }
-    }
-    return false;
+    return hasCommand(name, std::vector<char>{firstType, secondType});
 }
 
 // ---------------------------------------------------------------- leaves

@@ -4,32 +4,21 @@
 #include <cwchar>
 
 #include "base/kelmem.h"
-
-namespace {
-
-wchar_t* copyWide(wchar_t const* text) {
-    if (text == nullptr) return nullptr;
-    size_t n = wcslen(text) + 1;
-    wchar_t* copy = static_cast<wchar_t*>(kelm_malloc(n * sizeof(wchar_t)));
-    if (copy != nullptr) std::memcpy(copy, text, n * sizeof(wchar_t));
-    return copy;
-}
-
-}  // namespace
+#include "fscanner/fscommon/stringhelper.h"
 
 // ---- Field ------------------------------------------------------------------
 
 Field::Field(wchar_t const* fieldName, unsigned int fieldType)
-    : name(copyWide(fieldName)), type(fieldType), nullFlag(1) {}
+    : name(wideDuplicate(fieldName)), type(fieldType), nullFlag(1) {}
 
 Field::Field(const Field& other)
-    : name(copyWide(other.name)), type(other.type), nullFlag(other.nullFlag) {}
+    : name(wideDuplicate(other.name)), type(other.type), nullFlag(other.nullFlag) {}
 
 Field::~Field() { kelm_free(name); }
 
 Field& Field::operator=(const Field& other) {
     if (this != &other) {
-        wchar_t* copy = copyWide(other.name);
+        wchar_t* copy = wideDuplicate(other.name);
         kelm_free(name);
         name = copy;
         nullFlag = other.nullFlag;
@@ -39,7 +28,7 @@ Field& Field::operator=(const Field& other) {
 
 bool Field::setName(wchar_t const* newName) {
     if (newName == nullptr) return false;
-    wchar_t* copy = copyWide(newName);
+    wchar_t* copy = wideDuplicate(newName);
     if (copy == nullptr) return false;
     kelm_free(name);
     name = copy;
@@ -114,7 +103,7 @@ void TextField::value(wchar_t const* text) {
         std::memmove(inlineBuffer, text, (n + 1) * sizeof(wchar_t));
         current = inlineBuffer;
     } else {
-        wchar_t* block = copyWide(text);
+        wchar_t* block = wideDuplicate(text);
         if (block == nullptr) {
             inlineBuffer[0] = 0;  // out of memory: an empty value, never a dangling one
             block = inlineBuffer;

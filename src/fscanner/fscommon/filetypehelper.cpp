@@ -59,6 +59,30 @@ char quoteBreaker(char const* text) {
     return 0;
 }
 
+// True when text may stand double-quoted as the file command's argument:
+// nothing in it would end the quotes, and no leading '-' would make it an
+// option.  Otherwise the refusal is traced, as the checker's member function
+// naming what the text is ("path", "directory"), and the answer is false.
+bool quotableArgument(QvLogWrapper* log, char const* function, char const* what,
+                      std::string const& text) {
+    char bad = quoteBreaker(text.c_str());
+    if (bad != 0) {
+        log->traceMAX(__LINE__, __FILE__, function,
+                      "FileTypeChecker::%s - %s '%s' holds '%c', which would break the quoted "
+                      "command; not run\n",
+                      function, what, text.c_str(), bad);
+        return false;
+    }
+    if (text[0] == '-') {
+        log->traceMAX(__LINE__, __FILE__, function,
+                      "FileTypeChecker::%s - %s '%s' begins with '-' and would be read as an "
+                      "option; not run\n",
+                      function, what, text.c_str());
+        return false;
+    }
+    return true;
+}
+
 // The first character of text that the shell would read as more than a
 // literal in a bare word, or 0.  Blanks are let through: they only split the
 // word, which is what the unquoted list command does to such a name.
@@ -236,21 +260,7 @@ bool FileTypeChecker::getFileType(wchar_t const* path, wchar_t** out) {
                       "FileTypeChecker::getFileType - '%S' has no narrow form\n", path);
         return false;
     }
-    char bad = quoteBreaker(narrow.c_str());
-    if (bad != 0) {
-        log->traceMAX(__LINE__, __FILE__, function,
-                      "FileTypeChecker::getFileType - path '%s' holds '%c', which would break the "
-                      "quoted command; not run\n",
-                      narrow.c_str(), bad);
-        return false;
-    }
-    if (narrow[0] == '-') {
-        log->traceMAX(__LINE__, __FILE__, function,
-                      "FileTypeChecker::getFileType - path '%s' begins with '-' and would be read as an "
-                      "option; not run\n",
-                      narrow.c_str());
-        return false;
-    }
+    if (!quotableArgument(log, function, "path", narrow)) return false;
 
     char* cmd = makeCommand(FILE_COMMAND, narrow.c_str(), function);
     if (cmd == nullptr) return false;
@@ -353,21 +363,7 @@ bool FileTypeChecker::lookUpInDirectory(wchar_t const* path, wchar_t** out, bool
 
     Element answer;
     if (!listFileMode) {
-        char bad = quoteBreaker(dir.c_str());
-        if (bad != 0) {
-            log->traceMAX(__LINE__, __FILE__, function,
-                          "FileTypeChecker::getFileTypeEx - directory '%s' holds '%c', which would break "
-                          "the quoted command; not run\n",
-                          dir.c_str(), bad);
-            return false;
-        }
-        if (dir[0] == '-') {
-            log->traceMAX(__LINE__, __FILE__, function,
-                          "FileTypeChecker::getFileTypeEx - directory '%s' begins with '-' and would be "
-                          "read as an option; not run\n",
-                          dir.c_str());
-            return false;
-        }
+        if (!quotableArgument(log, function, "directory", dir)) return false;
         std::string prefix = dir == "/" ? dir : dir + "/";
         if (prefix.size() + 2 > BUFFER_SIZE) {
             log->traceMAX(__LINE__, __FILE__, function,

@@ -21,6 +21,28 @@ bool isDigit(wchar_t c) {
     return c >= L'0' && c <= L'9';
 }
 
+// Where the literal opened at start closes: the first closer behind it, or
+// NO_POSITION when the text ends first.
+size_t closingPosition(wchar_t const* text, size_t start, wchar_t closer) {
+    size_t end = start + 1;
+    while (text[end] != L'\0' && text[end] != closer) {
+        ++end;
+    }
+    return text[end] == closer ? end : NO_POSITION;
+}
+
+// Makes token a token of type whose text is the length characters at from.
+// False, token untouched, when the text can not be stored.
+bool textToken(fsToken& token, unsigned char type, wchar_t const* from, size_t length) {
+    fsToken made;
+    made.setType(type);
+    if (!made.setStringValue(from, static_cast<unsigned int>(length))) {
+        return false;
+    }
+    token = made;
+    return true;
+}
+
 }  // namespace
 
 // ---------------------------------------------------------------- fsToken
@@ -175,28 +197,22 @@ bool Lexer::recogniseSet(size_t start) {
     if (text[start] != L'{') {
         return false;
     }
-    size_t end = start + 1;
-    while (text[end] != L'\0' && text[end] != L'}') {
-        ++end;
-    }
-    if (text[end] != L'}') {
+    size_t end = closingPosition(text, start, L'}');
+    if (end == NO_POSITION) {
         return false;
     }
     size_t length = end - start - 1;
     if (length > LEXER_MAX_LITERAL) {
         return refuse();
     }
-    fsToken made;
-    made.setType(TOKEN_STRING);
-    if (!made.setStringValue(text + start + 1, static_cast<unsigned int>(length))) {
+    if (!textToken(token, TOKEN_STRING, text + start + 1, length)) {
         return false;
     }
     FileMaskLookup* lookup = new FileMaskLookup();
-    lookup->insert_stringlist(made.getStringValue());
+    lookup->insert_stringlist(token.getStringValue());
     lookup->commit_transaction(true);
     lookups.push_back(lookup);
-    made.lookup = lookup;
-    token = made;
+    token.lookup = lookup;
     position = end + 1;
     return true;
 }
@@ -292,12 +308,9 @@ bool Lexer::recogniseVariable(size_t start) {
     if (length > LEXER_MAX_VARIABLE) {
         return refuse();
     }
-    fsToken made;
-    made.setType(TOKEN_VARIABLE);
-    if (!made.setStringValue(text + start, static_cast<unsigned int>(length))) {
+    if (!textToken(token, TOKEN_VARIABLE, text + start, length)) {
         return false;
     }
-    token = made;
     position = end;
     return true;
 }
@@ -317,12 +330,9 @@ bool Lexer::recogniseField(size_t start) {
     if (length > LEXER_MAX_LITERAL) {
         return refuse();
     }
-    fsToken made;
-    made.setType(TOKEN_FIELD);
-    if (!made.setStringValue(text + start + 1, static_cast<unsigned int>(length))) {
+    if (!textToken(token, TOKEN_FIELD, text + start + 1, length)) {
         return false;
     }
-    token = made;
     position = end + 1;
     return true;
 }
@@ -331,23 +341,17 @@ bool Lexer::recogniseString(size_t start) {
     if (text[start] != L'"') {
         return false;
     }
-    size_t end = start + 1;
-    while (text[end] != L'\0' && text[end] != L'"') {
-        ++end;
-    }
-    if (text[end] != L'"') {
+    size_t end = closingPosition(text, start, L'"');
+    if (end == NO_POSITION) {
         return false;
     }
     size_t length = end - start - 1;
     if (length > LEXER_MAX_LITERAL) {
         return refuse();
     }
-    fsToken made;
-    made.setType(TOKEN_STRING);
-    if (!made.setStringValue(text + start + 1, static_cast<unsigned int>(length))) {
+    if (!textToken(token, TOKEN_STRING, text + start + 1, length)) {
         return false;
     }
-    token = made;
     position = end + 1;
     return true;
 }

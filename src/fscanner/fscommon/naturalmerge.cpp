@@ -240,6 +240,23 @@ void removeScratch(const wchar_t* name) {
     delete[] narrow;
 }
 
+// Traces a finished merge pass of either sort.  False, traced as well, when
+// runs are still left after MAX_PASSES: the sort gives up and the records are
+// not in order.
+bool passWithinLimit(QvLogWrapper* trace, const wchar_t* file, unsigned int passes,
+                     unsigned int runs) {
+    trace->traceMAX(__LINE__, __FILE__, "sort", "NaturalMergeSort::sort - pass %u merged %u runs\n",
+                    passes, runs);
+    if (runs > 1 && passes >= MAX_PASSES) {
+        trace->traceMIN(__LINE__, __FILE__, "sort",
+                        "NaturalMergeSort::sort - still %u runs after %u passes on [%S]; "
+                        "the records are not in order\n",
+                        runs, passes, file);
+        return false;
+    }
+    return true;
+}
+
 }  // namespace
 
 NaturalMergeSort::NaturalMergeSort(CompareCallback compare, ReadCallback read,
@@ -464,13 +481,7 @@ bool NaturalMergeSort::sort(wchar_t* file, unsigned int order, bool flag) {
         scratchA->close();
         scratchB->close();
         ++passes;
-        trace->traceMAX(__LINE__, __FILE__, __func__,
-                        "NaturalMergeSort::sort - pass %u merged %u runs\n", passes, runs);
-        if (runs > 1 && passes >= MAX_PASSES) {
-            trace->traceMIN(__LINE__, __FILE__, __func__,
-                            "NaturalMergeSort::sort - still %u runs after %u passes on [%S]; "
-                            "the records are not in order\n",
-                            runs, passes, file);
+        if (!passWithinLimit(trace, file, passes, runs)) {
             done = false;
             break;
         }
@@ -696,13 +707,7 @@ bool replayPasses(const wchar_t* file, const std::vector<NaturalMergeReplay::Rec
         }
         runs = merge<Ops>(sides, merged);
         ++passes;
-        trace->traceMAX(__LINE__, __FILE__, "sort", "NaturalMergeSort::sort - pass %u merged %u runs\n",
-                        passes, runs);
-        if (runs > 1 && passes >= MAX_PASSES) {
-            trace->traceMIN(__LINE__, __FILE__, "sort",
-                            "NaturalMergeSort::sort - still %u runs after %u passes on [%S]; "
-                            "the records are not in order\n",
-                            runs, passes, file);
+        if (!passWithinLimit(trace, file, passes, runs)) {
             done = false;
             break;
         }

@@ -3,6 +3,7 @@
 #include <errno.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <climits>
 #include <cstdlib>
 #include <cstring>
@@ -57,6 +58,22 @@ int longestCovering(const wchar_t* path, std::vector<Entry>& list, bool caseSens
         }
     }
     return best;
+}
+
+// True when list holds an entry equal to path.
+bool holds(const std::vector<PathInfo>& list, const PathInfo& path) {
+    return std::find(list.begin(), list.end(), path) != list.end();
+}
+
+// Traces every entry of one of the resolver's lists, named by what
+// ("resolved", "excluded", ...), on behalf of function.
+void traceResolverList(QvLogWrapper* log, const char* function, const char* what,
+                       const std::vector<PathDrive>& entries) {
+    for (const PathDrive& entry : entries)
+        log->traceMAX(__LINE__, __FILE__, function,
+                      "PathHelper::pathResolver - %s path ['%S'] [%d] ['%S']\n", what,
+                      safe(entry.getPathName()), static_cast<int>(entry.getDriveType()),
+                      safe(entry.getDriveName()));
 }
 
 }  // namespace
@@ -234,14 +251,7 @@ bool PathHelper::removePathListDuplicate(std::vector<PathInfo>& list) {
 void PathHelper::differencePathList(std::vector<PathInfo>& a, std::vector<PathInfo>& b,
                                     std::vector<PathInfo>& out) {
     for (const PathInfo& entry : a) {
-        bool found = false;
-        for (const PathInfo& other : b) {
-            if (entry == other) {
-                found = true;
-                break;
-            }
-        }
-        if (!found) out.push_back(entry);
+        if (!holds(b, entry)) out.push_back(entry);
     }
 }
 
@@ -262,16 +272,7 @@ void PathHelper::buildPathList(std::vector<DriveInfo>& drives, std::vector<PathI
 void PathHelper::appendPathList(std::vector<PathInfo>& src, std::vector<PathInfo>& dst, bool unique) {
     removePathListDuplicate(dst);
     for (const PathInfo& entry : src) {
-        if (unique) {
-            bool found = false;
-            for (const PathInfo& other : dst) {
-                if (entry == other) {
-                    found = true;
-                    break;
-                }
-            }
-            if (found) continue;
-        }
+        if (unique && holds(dst, entry)) continue;
         dst.push_back(entry);
     }
 }
@@ -551,24 +552,10 @@ int PathHelper::pathResolver(std::vector<PathInfo>& pathList, std::vector<DriveI
     excluded.clear();
     if (log->istraceActive(4)) {
         log->traceMAX(__LINE__, __FILE__, __func__, "PathHelper::pathResolver - list info...\n");
-        for (const PathDrive& entry : resolved)
-            log->traceMAX(__LINE__, __FILE__, __func__, "PathHelper::pathResolver - resolved path ['%S'] [%d] ['%S']\n",
-                          safe(entry.getPathName()), static_cast<int>(entry.getDriveType()),
-                          safe(entry.getDriveName()));
-        for (const PathDrive& entry : parentResolved)
-            log->traceMAX(__LINE__, __FILE__, __func__,
-                          "PathHelper::pathResolver - parent resolved path ['%S'] [%d] ['%S']\n",
-                          safe(entry.getPathName()), static_cast<int>(entry.getDriveType()),
-                          safe(entry.getDriveName()));
-        for (const PathDrive& entry : excluded)
-            log->traceMAX(__LINE__, __FILE__, __func__, "PathHelper::pathResolver - excluded path ['%S'] [%d] ['%S']\n",
-                          safe(entry.getPathName()), static_cast<int>(entry.getDriveType()),
-                          safe(entry.getDriveName()));
-        for (const PathDrive& entry : unresolved)
-            log->traceMAX(__LINE__, __FILE__, __func__,
-                          "PathHelper::pathResolver - unresolved path ['%S'] [%d] ['%S']\n",
-                          safe(entry.getPathName()), static_cast<int>(entry.getDriveType()),
-                          safe(entry.getDriveName()));
+        traceResolverList(log, __func__, "resolved", resolved);
+        traceResolverList(log, __func__, "parent resolved", parentResolved);
+        traceResolverList(log, __func__, "excluded", excluded);
+        traceResolverList(log, __func__, "unresolved", unresolved);
         log->traceMAX(__LINE__, __FILE__, __func__, "PathHelper::pathResolver - list info end\n");
     }
     return 1;
@@ -755,14 +742,7 @@ void PathHelper::fillExclude(PathDrive& root, std::vector<PathDrive>& excludes, 
             out.push_back(pathInfo);
         } else if (length > 1 && path[0] == L'*') {
             // No fixed part: it applies below any root, once.
-            bool present = false;
-            for (const PathInfo& other : out) {
-                if (other == pathInfo) {
-                    present = true;
-                    break;
-                }
-            }
-            if (!present) out.push_back(pathInfo);
+            if (!holds(out, pathInfo)) out.push_back(pathInfo);
         }
     }
 }

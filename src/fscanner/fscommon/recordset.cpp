@@ -90,10 +90,7 @@ bool __recordSet::setCriteria(CriteriaEvaluator* criteria, bool caseSensitive) {
                 key = static_cast<wchar_t*>(kelm_malloc(128));
                 if (key != nullptr) wcs_itoa(static_cast<unsigned int>(info->getNumber()), key);
             } else if (info->getType() == EXP_STRING) {
-                wchar_t const* text = info->getStringValue();
-                size_t n = wcslen(text) + 1;
-                key = static_cast<wchar_t*>(kelm_malloc(n * sizeof(wchar_t)));
-                if (key != nullptr) std::memcpy(key, text, n * sizeof(wchar_t));
+                key = wideDuplicate(info->getStringValue());
             }
             if (key != nullptr) {
                 wcsupper(key);
@@ -229,91 +226,27 @@ int __recordSet::unlock() {
     return 0;
 }
 
-unsigned char __recordSet::getFieldAsInt8(wchar_t const* name) {
-    Int8Field* f = column<Int8Field>(record, name, FIELD_INT8);
-    return f != nullptr ? f->value() : 0;
-}
-unsigned char __recordSet::getFieldAsInt8(unsigned int i) {
-    Int8Field* f = column<Int8Field>(record, i, FIELD_INT8);
-    return f != nullptr ? f->value() : 0;
-}
-unsigned short __recordSet::getFieldAsInt16(wchar_t const* name) {
-    Int16Field* f = column<Int16Field>(record, name, FIELD_INT16);
-    return f != nullptr ? f->value() : 0;
-}
-unsigned short __recordSet::getFieldAsInt16(unsigned int i) {
-    Int16Field* f = column<Int16Field>(record, i, FIELD_INT16);
-    return f != nullptr ? f->value() : 0;
-}
-unsigned int __recordSet::getFieldAsInt32(wchar_t const* name) {
-    Int32Field* f = column<Int32Field>(record, name, FIELD_INT32);
-    return f != nullptr ? f->value() : 0;
-}
-unsigned int __recordSet::getFieldAsInt32(unsigned int i) {
-    Int32Field* f = column<Int32Field>(record, i, FIELD_INT32);
-    return f != nullptr ? f->value() : 0;
-}
-unsigned long long __recordSet::getFieldAsInt64(wchar_t const* name) {
-    Int64Field* f = column<Int64Field>(record, name, FIELD_INT64);
-    return f != nullptr ? f->value() : 0;
-}
-unsigned long long __recordSet::getFieldAsInt64(unsigned int i) {
-    Int64Field* f = column<Int64Field>(record, i, FIELD_INT64);
-    return f != nullptr ? f->value() : 0;
-}
-wchar_t const* __recordSet::getFieldAsString(wchar_t const* name) {
-    TextField* f = column<TextField>(record, name, FIELD_TEXT);
-    return f != nullptr ? f->value() : nullptr;
-}
-wchar_t const* __recordSet::getFieldAsString(unsigned int i) {
-    TextField* f = column<TextField>(record, i, FIELD_TEXT);
-    return f != nullptr ? f->value() : nullptr;
-}
-unsigned char const* __recordSet::getFieldAsHex(wchar_t const* name) {
-    HexField* f = column<HexField>(record, name, FIELD_HEX);
-    return f != nullptr ? f->value() : nullptr;
-}
-unsigned char const* __recordSet::getFieldAsHex(unsigned int i) {
-    HexField* f = column<HexField>(record, i, FIELD_HEX);
-    return f != nullptr ? f->value() : nullptr;
-}
+// Each column type's getters and setters: the column by name or position,
+// when the buffer has it with that type (see column above).
+#define FSCANNER_CURSOR_FIELD_ACCESS(Suffix, Value, FieldClass, TypeNumber)     \
+    Value __recordSet::getFieldAs##Suffix(wchar_t const* name) {                \
+        FieldClass* f = column<FieldClass>(record, name, TypeNumber);           \
+        return f != nullptr ? f->value() : static_cast<Value>(0);               \
+    }                                                                           \
+    Value __recordSet::getFieldAs##Suffix(unsigned int i) {                     \
+        FieldClass* f = column<FieldClass>(record, i, TypeNumber);              \
+        return f != nullptr ? f->value() : static_cast<Value>(0);               \
+    }                                                                           \
+    void __recordSet::setFieldAs##Suffix(wchar_t const* name, Value v) {        \
+        if (FieldClass* f = column<FieldClass>(record, name, TypeNumber)) f->value(v); \
+    }                                                                           \
+    void __recordSet::setFieldAs##Suffix(unsigned int i, Value v) {             \
+        if (FieldClass* f = column<FieldClass>(record, i, TypeNumber)) f->value(v); \
+    }
 
-void __recordSet::setFieldAsInt8(wchar_t const* name, unsigned char v) {
-    if (Int8Field* f = column<Int8Field>(record, name, FIELD_INT8)) f->value(v);
-}
-void __recordSet::setFieldAsInt8(unsigned int i, unsigned char v) {
-    if (Int8Field* f = column<Int8Field>(record, i, FIELD_INT8)) f->value(v);
-}
-void __recordSet::setFieldAsInt16(wchar_t const* name, unsigned short v) {
-    if (Int16Field* f = column<Int16Field>(record, name, FIELD_INT16)) f->value(v);
-}
-void __recordSet::setFieldAsInt16(unsigned int i, unsigned short v) {
-    if (Int16Field* f = column<Int16Field>(record, i, FIELD_INT16)) f->value(v);
-}
-void __recordSet::setFieldAsInt32(wchar_t const* name, unsigned int v) {
-    if (Int32Field* f = column<Int32Field>(record, name, FIELD_INT32)) f->value(v);
-}
-void __recordSet::setFieldAsInt32(unsigned int i, unsigned int v) {
-    if (Int32Field* f = column<Int32Field>(record, i, FIELD_INT32)) f->value(v);
-}
-void __recordSet::setFieldAsInt64(wchar_t const* name, unsigned long long v) {
-    if (Int64Field* f = column<Int64Field>(record, name, FIELD_INT64)) f->value(v);
-}
-void __recordSet::setFieldAsInt64(unsigned int i, unsigned long long v) {
-    if (Int64Field* f = column<Int64Field>(record, i, FIELD_INT64)) f->value(v);
-}
-void __recordSet::setFieldAsString(wchar_t const* name, wchar_t const* v) {
-    if (TextField* f = column<TextField>(record, name, FIELD_TEXT)) f->value(v);
-}
-void __recordSet::setFieldAsString(unsigned int i, wchar_t const* v) {
-    if (TextField* f = column<TextField>(record, i, FIELD_TEXT)) f->value(v);
-}
-void __recordSet::setFieldAsHex(wchar_t const* name, unsigned char const* v) {
-    if (HexField* f = column<HexField>(record, name, FIELD_HEX)) f->value(v);
-}
-void __recordSet::setFieldAsHex(unsigned int i, unsigned char const* v) {
-    if (HexField* f = column<HexField>(record, i, FIELD_HEX)) f->value(v);
-}
+FSCANNER_RECORDSET_FIELD_TYPES(FSCANNER_CURSOR_FIELD_ACCESS)
+
+#undef FSCANNER_CURSOR_FIELD_ACCESS
 
 void __recordSet::printFields() {
     QvLogWrapper* log = getQvLogFs();
@@ -364,31 +297,24 @@ unsigned int RecordSet::count() { return rs != nullptr ? rs->count() : 0; }
 int RecordSet::lock(int timeout) { return rs != nullptr ? rs->lock(timeout) : SYNC_FAILED; }
 int RecordSet::unlock() { return rs != nullptr ? rs->unlock() : SYNC_FAILED; }
 
-unsigned char RecordSet::getFieldAsInt8(wchar_t const* n) { return rs != nullptr ? rs->getFieldAsInt8(n) : 0; }
-unsigned char RecordSet::getFieldAsInt8(unsigned int i) { return rs != nullptr ? rs->getFieldAsInt8(i) : 0; }
-unsigned short RecordSet::getFieldAsInt16(wchar_t const* n) { return rs != nullptr ? rs->getFieldAsInt16(n) : 0; }
-unsigned short RecordSet::getFieldAsInt16(unsigned int i) { return rs != nullptr ? rs->getFieldAsInt16(i) : 0; }
-unsigned int RecordSet::getFieldAsInt32(wchar_t const* n) { return rs != nullptr ? rs->getFieldAsInt32(n) : 0; }
-unsigned int RecordSet::getFieldAsInt32(unsigned int i) { return rs != nullptr ? rs->getFieldAsInt32(i) : 0; }
-unsigned long long RecordSet::getFieldAsInt64(wchar_t const* n) { return rs != nullptr ? rs->getFieldAsInt64(n) : 0; }
-unsigned long long RecordSet::getFieldAsInt64(unsigned int i) { return rs != nullptr ? rs->getFieldAsInt64(i) : 0; }
-wchar_t const* RecordSet::getFieldAsString(wchar_t const* n) { return rs != nullptr ? rs->getFieldAsString(n) : nullptr; }
-wchar_t const* RecordSet::getFieldAsString(unsigned int i) { return rs != nullptr ? rs->getFieldAsString(i) : nullptr; }
-unsigned char const* RecordSet::getFieldAsHex(wchar_t const* n) { return rs != nullptr ? rs->getFieldAsHex(n) : nullptr; }
-unsigned char const* RecordSet::getFieldAsHex(unsigned int i) { return rs != nullptr ? rs->getFieldAsHex(i) : nullptr; }
+// An empty handle reads 0 or null and stores nothing.
+#define FSCANNER_HANDLE_FIELD_ACCESS(Suffix, Value, FieldClass, TypeNumber)                   \
+    Value RecordSet::getFieldAs##Suffix(wchar_t const* n) {                                   \
+        return rs != nullptr ? rs->getFieldAs##Suffix(n) : static_cast<Value>(0);            \
+    }                                                                                         \
+    Value RecordSet::getFieldAs##Suffix(unsigned int i) {                                     \
+        return rs != nullptr ? rs->getFieldAs##Suffix(i) : static_cast<Value>(0);            \
+    }                                                                                         \
+    void RecordSet::setFieldAs##Suffix(wchar_t const* n, Value v) {                           \
+        if (rs != nullptr) rs->setFieldAs##Suffix(n, v);                                      \
+    }                                                                                         \
+    void RecordSet::setFieldAs##Suffix(unsigned int i, Value v) {                             \
+        if (rs != nullptr) rs->setFieldAs##Suffix(i, v);                                      \
+    }
 
-void RecordSet::setFieldAsInt8(wchar_t const* n, unsigned char v) { if (rs != nullptr) rs->setFieldAsInt8(n, v); }
-void RecordSet::setFieldAsInt8(unsigned int i, unsigned char v) { if (rs != nullptr) rs->setFieldAsInt8(i, v); }
-void RecordSet::setFieldAsInt16(wchar_t const* n, unsigned short v) { if (rs != nullptr) rs->setFieldAsInt16(n, v); }
-void RecordSet::setFieldAsInt16(unsigned int i, unsigned short v) { if (rs != nullptr) rs->setFieldAsInt16(i, v); }
-void RecordSet::setFieldAsInt32(wchar_t const* n, unsigned int v) { if (rs != nullptr) rs->setFieldAsInt32(n, v); }
-void RecordSet::setFieldAsInt32(unsigned int i, unsigned int v) { if (rs != nullptr) rs->setFieldAsInt32(i, v); }
-void RecordSet::setFieldAsInt64(wchar_t const* n, unsigned long long v) { if (rs != nullptr) rs->setFieldAsInt64(n, v); }
-void RecordSet::setFieldAsInt64(unsigned int i, unsigned long long v) { if (rs != nullptr) rs->setFieldAsInt64(i, v); }
-void RecordSet::setFieldAsString(wchar_t const* n, wchar_t const* v) { if (rs != nullptr) rs->setFieldAsString(n, v); }
-void RecordSet::setFieldAsString(unsigned int i, wchar_t const* v) { if (rs != nullptr) rs->setFieldAsString(i, v); }
-void RecordSet::setFieldAsHex(wchar_t const* n, unsigned char const* v) { if (rs != nullptr) rs->setFieldAsHex(n, v); }
-void RecordSet::setFieldAsHex(unsigned int i, unsigned char const* v) { if (rs != nullptr) rs->setFieldAsHex(i, v); }
+FSCANNER_RECORDSET_FIELD_TYPES(FSCANNER_HANDLE_FIELD_ACCESS)
+
+#undef FSCANNER_HANDLE_FIELD_ACCESS
 
 bool RecordSet::setCriteria(CriteriaEvaluator* e, bool caseSensitive) {
     return rs != nullptr && rs->setCriteria(e, caseSensitive);

@@ -23,6 +23,64 @@ class Index;
 class CriteriaEvaluator;
 class NameMaskFilter;
 
+// ---- the cursor operations, stated once for both classes -------------------
+//
+// RecordSet offers exactly the operations of __recordSet and forwards each to
+// its cursor; these lists declare them in both.  On the cursor:
+//
+//   moveFirst, moveNext, movePrevious: position and read the record.  moveLast
+//     is always false (see the .cpp): the table's own moveLast reports failure.
+//   read, insert, update, remove: the current record and the buffer.
+//   count: number of live records minus one (0 for an empty table too).
+//   lock(timeout), unlock: the table's lock.
+//   getFieldAs..., setFieldAs...: field access by name or position.  A column
+//     the buffer lacks, or holds with another type than the call's, fails the
+//     call: getters give 0 or null, setters store nothing.
+//   setCriteria: binds evaluator (not owned) to the record buffer and, where it
+//     names an indexed column with a fixed value, switches to index
+//     navigation.  A null evaluator, or one without criteria text, ends
+//     filtering.  Always true.
+//   printFields: traces every field of the buffer at the most detailed level.
+//
+// The handle's operations on an empty handle do nothing and give false, 0,
+// null or SYNC_FAILED.
+
+// One row a column type: the suffix of its getFieldAs/setFieldAs pair, the
+// value type, the field class and its type number.
+#define FSCANNER_RECORDSET_FIELD_TYPES(X)                 \
+    X(Int8, unsigned char, Int8Field, FIELD_INT8)         \
+    X(Int16, unsigned short, Int16Field, FIELD_INT16)     \
+    X(Int32, unsigned int, Int32Field, FIELD_INT32)       \
+    X(Int64, unsigned long long, Int64Field, FIELD_INT64) \
+    X(String, wchar_t const*, TextField, FIELD_TEXT)      \
+    X(Hex, unsigned char const*, HexField, FIELD_HEX)
+
+#define FSCANNER_RECORDSET_DECLARE_FIELD_ACCESS(Suffix, Value, FieldClass, TypeNumber) \
+    Value getFieldAs##Suffix(wchar_t const* name);                                   \
+    Value getFieldAs##Suffix(unsigned int index);                                    \
+    void setFieldAs##Suffix(wchar_t const* name, Value value);                       \
+    void setFieldAs##Suffix(unsigned int index, Value value);
+
+#define FSCANNER_RECORDSET_OPERATIONS                                        \
+    bool moveFirst();                                                        \
+    bool moveNext();                                                         \
+    bool movePrevious();                                                     \
+    bool moveLast();                                                         \
+                                                                             \
+    bool read();                                                             \
+    bool insert();                                                           \
+    bool update();                                                           \
+    bool remove();                                                           \
+                                                                             \
+    unsigned int count();                                                    \
+    int lock(int timeout);                                                   \
+    int unlock();                                                            \
+                                                                             \
+    FSCANNER_RECORDSET_FIELD_TYPES(FSCANNER_RECORDSET_DECLARE_FIELD_ACCESS)  \
+                                                                             \
+    bool setCriteria(CriteriaEvaluator* evaluator, bool caseSensitive);      \
+    void printFields();
+
 class __recordSet {
 public:
     // An empty cursor: read, insert, update and remove give false.
@@ -32,58 +90,7 @@ public:
     // Frees the key and deletes the buffer.
     ~__recordSet();
 
-    bool moveFirst();
-    bool moveNext();
-    bool movePrevious();
-    // Always false (see the .cpp): the table's own moveLast reports failure.
-    bool moveLast();
-
-    bool read();
-    bool insert();
-    bool update();
-    bool remove();
-
-    // Number of live records minus one (0 for an empty table too).
-    unsigned int count();
-    int lock(int timeout);
-    int unlock();
-
-    // Field access by name or position.  A column the buffer lacks, or holds
-    // with another type than the call's, fails the call: getters give 0 or
-    // null, setters store nothing.
-    unsigned char getFieldAsInt8(wchar_t const* name);
-    unsigned char getFieldAsInt8(unsigned int index);
-    unsigned short getFieldAsInt16(wchar_t const* name);
-    unsigned short getFieldAsInt16(unsigned int index);
-    unsigned int getFieldAsInt32(wchar_t const* name);
-    unsigned int getFieldAsInt32(unsigned int index);
-    unsigned long long getFieldAsInt64(wchar_t const* name);
-    unsigned long long getFieldAsInt64(unsigned int index);
-    wchar_t const* getFieldAsString(wchar_t const* name);
-    wchar_t const* getFieldAsString(unsigned int index);
-    unsigned char const* getFieldAsHex(wchar_t const* name);
-    unsigned char const* getFieldAsHex(unsigned int index);
-
-    void setFieldAsInt8(wchar_t const* name, unsigned char value);
-    void setFieldAsInt8(unsigned int index, unsigned char value);
-    void setFieldAsInt16(wchar_t const* name, unsigned short value);
-    void setFieldAsInt16(unsigned int index, unsigned short value);
-    void setFieldAsInt32(wchar_t const* name, unsigned int value);
-    void setFieldAsInt32(unsigned int index, unsigned int value);
-    void setFieldAsInt64(wchar_t const* name, unsigned long long value);
-    void setFieldAsInt64(unsigned int index, unsigned long long value);
-    void setFieldAsString(wchar_t const* name, wchar_t const* value);
-    void setFieldAsString(unsigned int index, wchar_t const* value);
-    void setFieldAsHex(wchar_t const* name, unsigned char const* value);
-    void setFieldAsHex(unsigned int index, unsigned char const* value);
-
-    // Binds evaluator (not owned) to the record buffer and, where it names an
-    // indexed column with a fixed value, switches to index navigation.  A null
-    // evaluator, or one without criteria text, ends filtering.  Always true.
-    bool setCriteria(CriteriaEvaluator* evaluator, bool caseSensitive);
-
-    // Traces every field of the buffer at the most detailed level.
-    void printFields();
+    FSCANNER_RECORDSET_OPERATIONS
 
     // For inspection by tests.
     unsigned int getId() const { return id; }
@@ -123,48 +130,7 @@ public:
     RecordSet() : rs(nullptr) {}
     explicit RecordSet(__recordSet* inner) : rs(inner) {}
 
-    bool moveFirst();
-    bool moveNext();
-    bool movePrevious();
-    bool moveLast();
-
-    bool read();
-    bool insert();
-    bool update();
-    bool remove();
-
-    unsigned int count();
-    int lock(int timeout);
-    int unlock();
-
-    unsigned char getFieldAsInt8(wchar_t const* name);
-    unsigned char getFieldAsInt8(unsigned int index);
-    unsigned short getFieldAsInt16(wchar_t const* name);
-    unsigned short getFieldAsInt16(unsigned int index);
-    unsigned int getFieldAsInt32(wchar_t const* name);
-    unsigned int getFieldAsInt32(unsigned int index);
-    unsigned long long getFieldAsInt64(wchar_t const* name);
-    unsigned long long getFieldAsInt64(unsigned int index);
-    wchar_t const* getFieldAsString(wchar_t const* name);
-    wchar_t const* getFieldAsString(unsigned int index);
-    unsigned char const* getFieldAsHex(wchar_t const* name);
-    unsigned char const* getFieldAsHex(unsigned int index);
-
-    void setFieldAsInt8(wchar_t const* name, unsigned char value);
-    void setFieldAsInt8(unsigned int index, unsigned char value);
-    void setFieldAsInt16(wchar_t const* name, unsigned short value);
-    void setFieldAsInt16(unsigned int index, unsigned short value);
-    void setFieldAsInt32(wchar_t const* name, unsigned int value);
-    void setFieldAsInt32(unsigned int index, unsigned int value);
-    void setFieldAsInt64(wchar_t const* name, unsigned long long value);
-    void setFieldAsInt64(unsigned int index, unsigned long long value);
-    void setFieldAsString(wchar_t const* name, wchar_t const* value);
-    void setFieldAsString(unsigned int index, wchar_t const* value);
-    void setFieldAsHex(wchar_t const* name, unsigned char const* value);
-    void setFieldAsHex(unsigned int index, unsigned char const* value);
-
-    bool setCriteria(CriteriaEvaluator* evaluator, bool caseSensitive);
-    void printFields();
+    FSCANNER_RECORDSET_OPERATIONS
 
     __recordSet* get() const { return rs; }
     bool isEmpty() const { return rs == nullptr; }

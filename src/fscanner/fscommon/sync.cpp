@@ -35,6 +35,26 @@ std::map<std::string, _sem_info*>* semaphoreRegistry = nullptr;
 // Must be defined after the statics above: it initialises them.
 LinuxSyncInit linuxSyncInit;
 
+// The entry of key in a process-wide registry (mutexes or semaphores) with
+// one more user; for a new key, a fresh entry of one user, set up by prepare,
+// is entered.  True when the entry is new.
+template <class Info, class Prepare>
+bool shareEntry(std::map<std::string, Info*>& registry, const std::string& key, Info** out,
+                Prepare prepare) {
+    auto it = registry.find(key);
+    if (it != registry.end()) {
+        it->second->refCount++;
+        *out = it->second;
+        return false;
+    }
+    Info* info = new Info;
+    info->refCount = 1;
+    prepare(info);
+    registry[key] = info;
+    *out = info;
+    return true;
+}
+
 }  // namespace
 
 LinuxSyncInit::LinuxSyncInit() {
@@ -190,21 +210,11 @@ std::map<std::string, _mutex_info*>* LinuxMutex::mutexes_ptr() {
 }
 
 bool LinuxMutex::mutex_init(std::string key, _mutex_info** out) {
-    std::map<std::string, _mutex_info*>* registry = mutexes_ptr();
-    auto it = registry->find(key);
-    if (it != registry->end()) {
-        it->second->refCount++;
-        *out = it->second;
-        return false;
-    }
-    _mutex_info* info = new _mutex_info;
-    info->refCount = 1;
-    info->locked = 0;
-    pthread_mutex_init(&info->mutex, DEFAULT_MUTEX_ATTR);
-    pthread_cond_init(&info->cond, DEFAULT_COND_ATTR);
-    (*registry)[key] = info;
-    *out = info;
-    return true;
+    return shareEntry(*mutexes_ptr(), key, out, [](_mutex_info* info) {
+        info->locked = 0;
+        pthread_mutex_init(&info->mutex, DEFAULT_MUTEX_ATTR);
+        pthread_cond_init(&info->cond, DEFAULT_COND_ATTR);
+    });
 }
 
 void LinuxMutex::mutex_exit(std::string key, _mutex_info* info) {
@@ -295,19 +305,8 @@ std::map<std::string, _sem_info*>* LinuxSemaphore::semaphores_ptr() {
 }
 
 bool LinuxSemaphore::semaphore_init(std::string key, _sem_info** out) {
-    std::map<std::string, _sem_info*>* registry = semaphores_ptr();
-    auto it = registry->find(key);
-    if (it != registry->end()) {
-        it->second->refCount++;
-        *out = it->second;
-        return false;
-    }
-    _sem_info* info = new _sem_info;
-    info->refCount = 1;
-    sem_init(&info->sem, 0, 0);
-    (*registry)[key] = info;
-    *out = info;
-    return true;
+    return shareEntry(*semaphores_ptr(), key, out,
+                      [](_sem_info* info) { sem_init(&info->sem, 0, 0); });
 }
 
 void LinuxSemaphore::semaphore_exit(std::string key, _sem_info* info) {

@@ -7,17 +7,8 @@
 
 #include "base/QvLogWrapper.h"
 #include "fscanner/fscommon/fields.h"
+#include "fscanner/fscommon/syntaxfail.h"
 #include "fscanner/fscommon/wildcard.h"
-
-// Sets the analyzer's failure flag, keeps its text and traces one line.
-#define FS_SA_FAIL(...)                                                              \
-    do {                                                                             \
-        error = true;                                                                \
-        noteError(QvLogWrapper::format(__VA_ARGS__));                                \
-        if (trace != nullptr) {                                                      \
-            trace->traceMAX(__LINE__, __FILE__, __FUNCTION__, __VA_ARGS__);          \
-        }                                                                            \
-    } while (0)
 
 // ---------------------------------------------------------------- Tree
 
@@ -255,6 +246,48 @@ bool isToken(fsToken const& token, unsigned char type, unsigned long long number
     return token.type == type && token.numericValue == number;
 }
 
+// The operators of each binary level of the grammar.
+bool isOrOperator(fsToken const& t) { return isToken(t, TOKEN_BOOLEAN, OP_LOGICAL_OR); }
+bool isAndOperator(fsToken const& t) { return isToken(t, TOKEN_BOOLEAN, OP_LOGICAL_AND); }
+bool isRelationalOperator(fsToken const& t) { return t.type == TOKEN_RELATIONAL; }
+bool isAddingOperator(fsToken const& t) {
+    return t.type == TOKEN_ARITHMETIC &&
+           (t.numericValue == OP_PLUS || t.numericValue == OP_MINUS || t.numericValue == OP_OR);
+}
+bool isMultiplyingOperator(fsToken const& t) {
+    return t.type == TOKEN_ARITHMETIC && (t.numericValue == OP_MULTIPLY ||
+                                          t.numericValue == OP_DIVIDE || t.numericValue == OP_AND);
+}
+
+// The next token when it is one of the calling level's operators (accepts
+// says which); any other token goes back to the lexer, and the level is done.
+bool nextOperator(Lexer* lexer, fsToken& op, bool (*accepts)(fsToken const&)) {
+    op = lexer->nextToken();
+    if (accepts(op)) {
+        return true;
+    }
+    lexer->back();
+    return false;
+}
+
+// The right operand of one binary operator: its value, and the tree of its
+// tokens, which attach hangs under the operator in the level's tree.  The
+// operand's own tree goes with it, so a level that gives up just returns.
+struct RightOperand {
+    RightOperand() : tree(new Tree()) { tree->setRoot(); }
+    ~RightOperand() { delete tree; }
+    RightOperand(const RightOperand&) = delete;
+    RightOperand& operator=(const RightOperand&) = delete;
+
+    void attach(Tree** into, fsToken const& op) {
+        (*into)->merge(tree);
+        (*into)->setData((*into)->getRoot(), op);
+    }
+
+    Tree* tree;
+    ExpValue value;
+};
+
 // Counts one factor on the recursion stack for as long as it lives.
 class NestingGuard {
 public:
@@ -278,41 +311,31 @@ void SyntaxAnalyzer::bExpression(ExpValue& value, bool evaluate, Tree** tree) {
     if (error) {
         return;
     }
-    for (;;) {
-        fsToken op = lexer->nextToken();
-        if (!isToken(op, TOKEN_BOOLEAN, OP_LOGICAL_OR)) {
-            lexer->back();
-            return;
-        }
+    fsToken op;
+    while (nextOperator(lexer, op, isOrOperator)) {
         simple = false;
         ++orDepth;
-        Tree* right = new Tree();
-        right->setRoot();
-        ExpValue rightValue;
+        RightOperand right;
         // The right side is live only while the left is 0.
-        bTerm(rightValue, evaluate && value.number == 0, &right);
+        bTerm(right.value, evaluate && value.number == 0, &right.tree);
         --orDepth;
         if (!hadCandidate) {
             // A candidate found inside a disjunction proves nothing.
             hashValue.clear();
         }
         if (error) {
-            delete right;
             return;
         }
-        if (!value.isNumeric() || !rightValue.isNumeric()) {
-            delete right;
+        if (!value.isNumeric() || !right.value.isNumeric()) {
             FS_SA_FAIL(
                 "SyntaxAnalyzer::bExpression - bExpression operands of different types or not "
                 "NUMERIC\n");
             return;
         }
-        unsigned long long result = (value.number != 0 || rightValue.number != 0) ? 1 : 0;
-        deriveFlags(value, value, rightValue);
+        unsigned long long result = (value.number != 0 || right.value.number != 0) ? 1 : 0;
+        deriveFlags(value, value, right.value);
         setNumber(value, result);
-        (*tree)->merge(right);
-        (*tree)->setData((*tree)->getRoot(), op);
-        delete right;
+        right.attach(tree, op);
     }
 }
 
@@ -324,37 +347,27 @@ void SyntaxAnalyzer::bTerm(ExpValue& value, bool evaluate, Tree** tree) {
     if (error) {
         return;
     }
-    for (;;) {
-        fsToken op = lexer->nextToken();
-        if (!isToken(op, TOKEN_BOOLEAN, OP_LOGICAL_AND)) {
-            lexer->back();
-            return;
-        }
+    fsToken op;
+    while (nextOperator(lexer, op, isAndOperator)) {
         // Once the chain is 0 the rest of it is dead.
         if (value.number == 0) {
             evaluate = false;
         }
-        Tree* right = new Tree();
-        right->setRoot();
-        ExpValue rightValue;
-        relation(rightValue, evaluate, &right);
+        RightOperand right;
+        relation(right.value, evaluate, &right.tree);
         simple = (orDepth == 0);
         if (error) {
-            delete right;
             return;
         }
-        if (!value.isNumeric() || !rightValue.isNumeric()) {
-            delete right;
+        if (!value.isNumeric() || !right.value.isNumeric()) {
             FS_SA_FAIL(
                 "SyntaxAnalyzer::bTerm - bTerm operands of different types or not NUMERIC\n");
             return;
         }
-        unsigned long long result = (value.number != 0 && rightValue.number != 0) ? 1 : 0;
-        deriveFlags(value, value, rightValue);
+        unsigned long long result = (value.number != 0 && right.value.number != 0) ? 1 : 0;
+        deriveFlags(value, value, right.value);
         setNumber(value, result);
-        (*tree)->merge(right);
-        (*tree)->setData((*tree)->getRoot(), op);
-        delete right;
+        right.attach(tree, op);
     }
 }
 
@@ -397,46 +410,35 @@ void SyntaxAnalyzer::relation(ExpValue& value, bool evaluate, Tree** tree) {
     if (error) {
         return;
     }
-    for (;;) {
-        fsToken op = lexer->nextToken();
-        if (op.type != TOKEN_RELATIONAL) {
-            lexer->back();
-            return;
-        }
-        Tree* right = new Tree();
-        right->setRoot();
-        ExpValue rightValue;
-        expression(rightValue, evaluate, &right);
+    fsToken op;
+    while (nextOperator(lexer, op, isRelationalOperator)) {
+        RightOperand right;
+        expression(right.value, evaluate, &right.tree);
         if (error) {
-            delete right;
             return;
         }
-        if (value.getType() != rightValue.getType()) {
-            delete right;
+        if (value.getType() != right.value.getType()) {
             FS_SA_FAIL("SyntaxAnalyzer::relation - relation operands of different types!\n");
             return;
         }
         unsigned int relop = static_cast<unsigned int>(op.numericValue);
         if (relop > OP_NOT_EQUAL) {
-            delete right;
             FS_SA_FAIL("SyntaxAnalyzer::relation - OpRelXXX unknown!\n");
             return;
         }
         if (relop == OP_EQUAL) {
-            captureCandidate(value, rightValue);
+            captureCandidate(value, right.value);
         }
         bool holds = value.isString()
-                         ? expCompareStrings(relop, value, rightValue, caseSensitive)
-                         : expCompareNumbers(relop, value.number, rightValue.number);
+                         ? expCompareStrings(relop, value, right.value, caseSensitive)
+                         : expCompareNumbers(relop, value.number, right.value.number);
         // The result counts as a field's if either side was one.
-        int32_t fromField = (value.isField != 0 || rightValue.isField != 0) ? 1 : 0;
+        int32_t fromField = (value.isField != 0 || right.value.isField != 0) ? 1 : 0;
         value.clear();
         value.setNumericValue(holds ? 1 : 0);
         value.isField = fromField;
         value.isConstant = fromField ? 0 : 1;
-        (*tree)->merge(right);
-        (*tree)->setData((*tree)->getRoot(), op);
-        delete right;
+        right.attach(tree, op);
     }
 }
 
@@ -448,60 +450,46 @@ void SyntaxAnalyzer::expression(ExpValue& value, bool evaluate, Tree** tree) {
     if (error) {
         return;
     }
-    for (;;) {
-        fsToken op = lexer->nextToken();
+    fsToken op;
+    while (nextOperator(lexer, op, isAddingOperator)) {
         unsigned long long number = op.numericValue;
-        if (op.type != TOKEN_ARITHMETIC ||
-            (number != OP_PLUS && number != OP_MINUS && number != OP_OR)) {
-            lexer->back();
-            return;
-        }
-        Tree* right = new Tree();
-        right->setRoot();
-        ExpValue rightValue;
-        term(rightValue, evaluate, &right);
+        RightOperand right;
+        term(right.value, evaluate, &right.tree);
         if (error) {
-            delete right;
             return;
         }
-        if (value.isString() && rightValue.isString()) {
+        if (value.isString() && right.value.isString()) {
             if (number != OP_PLUS) {
-                delete right;
                 FS_SA_FAIL(
                     "SyntaxAnalyzer::expression - operator '%s' not permitted on string type\n",
                     number == OP_MINUS ? "-" : "|");
                 return;
             }
             ExpValue joined;
-            if (!expConcatenate(value, rightValue, joined)) {
-                delete right;
+            if (!expConcatenate(value, right.value, joined)) {
                 FS_SA_FAIL(
                     "SyntaxAnalyzer::expression - string space not available for "
                     "concatenation\n");
                 return;
             }
-            deriveFlags(joined, value, rightValue);
+            deriveFlags(joined, value, right.value);
             value = joined;
-        } else if (value.isNumeric() && rightValue.isNumeric()) {
+        } else if (value.isNumeric() && right.value.isNumeric()) {
             unsigned long long result = 0;
             if (!expArithmetic(static_cast<unsigned int>(number), value.number,
-                               rightValue.number, &result)) {
-                delete right;
+                               right.value.number, &result)) {
                 FS_SA_FAIL("SyntaxAnalyzer::expression - OpXXX unknown!\n");
                 return;
             }
-            deriveFlags(value, value, rightValue);
+            deriveFlags(value, value, right.value);
             setNumber(value, result);
         } else {
-            delete right;
             FS_SA_FAIL(
                 "SyntaxAnalyzer::expression - expression operands of different types or not "
                 "NUMERIC\n");
             return;
         }
-        (*tree)->merge(right);
-        (*tree)->setData((*tree)->getRoot(), op);
-        delete right;
+        right.attach(tree, op);
     }
 }
 
@@ -513,50 +501,37 @@ void SyntaxAnalyzer::term(ExpValue& value, bool evaluate, Tree** tree) {
     if (error) {
         return;
     }
-    for (;;) {
-        fsToken op = lexer->nextToken();
+    fsToken op;
+    while (nextOperator(lexer, op, isMultiplyingOperator)) {
         unsigned long long number = op.numericValue;
-        if (op.type != TOKEN_ARITHMETIC ||
-            (number != OP_MULTIPLY && number != OP_DIVIDE && number != OP_AND)) {
-            lexer->back();
-            return;
-        }
-        Tree* right = new Tree();
-        right->setRoot();
-        ExpValue rightValue;
-        factor(rightValue, evaluate, &right);
+        RightOperand right;
+        factor(right.value, evaluate, &right.tree);
         if (error) {
-            delete right;
             return;
         }
-        if (!value.isNumeric() || !rightValue.isNumeric()) {
-            delete right;
+        if (!value.isNumeric() || !right.value.isNumeric()) {
             FS_SA_FAIL(
                 "SyntaxAnalyzer::term - term operands of different types or not NUMERIC\n");
             return;
         }
         unsigned long long result = 0;
-        if (!expArithmetic(static_cast<unsigned int>(number), value.number, rightValue.number,
+        if (!expArithmetic(static_cast<unsigned int>(number), value.number, right.value.number,
                            &result)) {
-            if (number == OP_DIVIDE && rightValue.number == 0) {
+            if (number == OP_DIVIDE && right.value.number == 0) {
                 if (evaluate) {
-                    delete right;
                     FS_SA_FAIL("SyntaxAnalyzer::term - division by zero!\n");
                     return;
                 }
                 // A dead operand's value is never used: it stays 0.
                 result = 0;
             } else {
-                delete right;
                 FS_SA_FAIL("SyntaxAnalyzer::term - OpXXX unknown!\n");
                 return;
             }
         }
-        deriveFlags(value, value, rightValue);
+        deriveFlags(value, value, right.value);
         setNumber(value, result);
-        (*tree)->merge(right);
-        (*tree)->setData((*tree)->getRoot(), op);
-        delete right;
+        right.attach(tree, op);
     }
 }
 
