@@ -254,8 +254,9 @@ public:
     bool verifyWhole();
     // Under the guard: check, called on every record read whole with the
     // table's own columns, answers null for a sound record or the text of
-    // its failed check, which becomes the damage of the data file.  The
-    // context is the caller's and must outlive the table's open state.
+    // its failed check, which becomes the damage of the data file.  No
+    // effect before verify(); close() forgets it.  The context is the
+    // caller's and must outlive the table's open state.
     void setRowCheck(char const* (*check)(void* context, Fields& record), void* context);
     bool isDamaged() const;
     // While the guard is armed the table also keeps its first failed write:
