@@ -370,11 +370,13 @@ bool FS_CacheBase::openCache()
     cacheUnusable = false;
     openCursors();
     // The files carry no checksum; what they say of each other is checked
-    // here and, by the tables' guards, at every read.  A damaged cache opens
-    // latched: queries answer -40 and close removes it for a rebuild.
+    // here as far as it costs the same for any size and, by the tables'
+    // guards, at every read for what that read relies on.  A cache found
+    // damaged here opens latched; one a query finds damaged answers -40 and
+    // latches then.  Either way close removes it for a rebuild.
     std::wstring damagedFile;
     char const* failedCheck = nullptr;
-    if (!cachetables::checkCacheTables(tbDirectories, tbFiles, directoriesIndex, &damagedFile,
+    if (!cachetables::checkCacheTables(tbDirectories, tbFiles, &directoriesIndex, &damagedFile,
                                        &failedCheck)) {
         FS_TRACE(log, MIN, "damaged cache file '%ls': %s", damagedFile.c_str(),
                            failedCheck != nullptr ? failedCheck : "");

@@ -120,8 +120,37 @@ bool sameLayout(FS_Table* table, wchar_t const* const* columns, unsigned int con
 
 }  // namespace
 
-bool cachetables::checkCacheTables(FS_Table* directories, FS_Table* files, unsigned int counter,
-                                   std::wstring* file, char const** check)
+namespace {
+
+char const* const idOutsideCounter = "directory id outside the ids the counter has given";
+
+// The row check of the directories table: the id counter the cache hands
+// ids out from, read at each row, since a scan raises it while rows are read.
+char const* checkDirectoryRow(void* context, Fields& row)
+{
+    unsigned int counter = *static_cast<unsigned int const*>(context);
+    Field* id = row.name(L"ID");
+    Field* parent = row.name(L"PARENTID");
+    if (id == nullptr || parent == nullptr || id->getType() != cachetables::TYPE_INT32 ||
+        parent->getType() != cachetables::TYPE_INT32)
+        return nullptr;
+    unsigned int own = static_cast<Int32Field*>(id)->value();
+    if (own == 0 || own > counter)
+        return idOutsideCounter;
+    // Every existing id is one the counter gave: a parent above it cannot
+    // exist.  One below it is found or not when the path is rebuilt, and
+    // the index checks of each read catch a changed id.
+    unsigned int up = static_cast<Int32Field*>(parent)->value();
+    if (up > counter)
+        return "directory row names a parent that does not exist";
+    return nullptr;
+}
+
+}  // namespace
+
+bool cachetables::checkCacheTables(FS_Table* directories, FS_Table* files,
+                                   unsigned int const* counter, std::wstring* file,
+                                   char const** check)
 {
     if (directories == nullptr || files == nullptr)
         return true;
@@ -145,39 +174,16 @@ bool cachetables::checkCacheTables(FS_Table* directories, FS_Table* files, unsig
             return false;
         }
     }
-
-    // Every directory row, through the guarded reads.
-    std::vector<std::pair<unsigned int, unsigned int>> rows;  // id, parent id
-    RecordSet set = directories->openRecordSet();
-    for (bool row = set.moveFirst(); row; row = set.moveNext())
-        rows.emplace_back(set.getFieldAsInt32(L"ID"), set.getFieldAsInt32(L"PARENTID"));
-    directories->closeRecordSet(set);
-    if (directories->isDamaged()) {
-        *file = directories->damagedFile();
-        *check = directories->damagedCheck();
+    // Live rows have distinct ids from 1 to the counter, so there are no
+    // more of them than the counter: otherwise one id is outside or two
+    // rows share one.
+    unsigned int stored = 0;
+    if (directories->count(0, &stored) && stored > *counter) {
+        *file = directories->getDataPath();
+        *check = idOutsideCounter;
         return false;
     }
-    *file = directories->getDataPath();
-    std::vector<unsigned int> ids;
-    ids.reserve(rows.size());
-    for (auto const& r : rows) {
-        if (r.first == 0 || r.first > counter) {
-            *check = "directory id outside the ids the counter has given";
-            return false;
-        }
-        ids.push_back(r.first);
-    }
-    std::sort(ids.begin(), ids.end());
-    if (std::adjacent_find(ids.begin(), ids.end()) != ids.end()) {
-        *check = "two directory rows have one id";
-        return false;
-    }
-    for (auto const& r : rows) {
-        if (r.second != 0 && !std::binary_search(ids.begin(), ids.end(), r.second)) {
-            *check = "directory row names a parent that does not exist";
-            return false;
-        }
-    }
+    directories->setRowCheck(checkDirectoryRow, const_cast<unsigned int*>(counter));
     return true;
 }
 

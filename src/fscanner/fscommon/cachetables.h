@@ -55,14 +55,16 @@ const unsigned int MEMO_TEXT_BYTES = 0x4004;
 const unsigned int MEMO_ENTRIES = 32;
 
 // Checks the two tables of a cache opened from disk before they serve, in
-// time linear in the directories table and in both tables' pointer and index
-// files: each has exactly the schema above and only the indexes above (one
-// may be missing: the table then walks), FS_Table::verify passes and arms
-// the tables' guards, and every directory row has an id from 1 to the
-// counter, no other row has that id, and its parent is 0 or an existing id.
-// True when all holds; otherwise false with the file and the check of the
-// first failure in *file and *check.
-bool checkCacheTables(FS_Table* directories, FS_Table* files, unsigned int counter,
+// time independent of their size: each has exactly the schema above and only
+// the indexes above (one may be missing: the table then walks),
+// FS_Table::verify passes and arms the tables' guards, and the directories
+// table holds no more rows than the counter has given ids.  It also gives
+// the directories table a row check: every directory row read has an id from
+// 1 to *counter and a parent of at most *counter (the existence of that
+// parent is checked where the path is rebuilt).  counter must stay valid
+// while the tables are open.  True when all holds; otherwise false with the
+// file and the check of the first failure in *file and *check.
+bool checkCacheTables(FS_Table* directories, FS_Table* files, unsigned int const* counter,
                       std::wstring* file, char const** check);
 }  // namespace cachetables
 

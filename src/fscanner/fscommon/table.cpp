@@ -699,7 +699,7 @@ bool FS_Table::peekedGuardedRead(unsigned int id, Fields& record) {
     }
     if (dataFile == nullptr || pointerFile == nullptr || guard->damaged) return false;
     uint32_t offset;
-    if (!readSlot(id, &offset) || offset == kRemovedSlot) return false;
+    if (!readSlot(id, &offset) || offset == kRemovedSlot || !guardSlot(id, offset)) return false;
     uint32_t end;
     if (!peekRecord(offset, schema, &end) || !peekPassesGuard(id, end)) return false;
     // Every check of the guarded read passed on these bytes: store them as
@@ -723,6 +723,8 @@ bool FS_Table::peekedGuardedRead(unsigned int id, Fields& record) {
                 break;
         }
     }
+    // A refused row is left to the guarded read, which notes the damage.
+    if (guard->rowCheck != nullptr && guard->rowCheck(guard->rowCheckContext, record) != nullptr) return false;
     return dataFile->seek(static_cast<long>(end), SEEK_FROM_START);
 }
 
@@ -921,8 +923,7 @@ bool FS_Table::peekPassesGuard(unsigned int id, uint32_t end) {
     uint32_t nextOffset = kRemovedSlot;
     if (id != 0xFFFFFFFFu && readSlot(id + 1, &nextOffset) && nextOffset != kRemovedSlot && nextOffset != end)
         return false;
-    for (TableGuard::IndexBuckets const& entry : guard->indexes) {
-        if (id >= entry.bucketOf.size() || entry.bucketOf[id] == TableGuard::UNKNOWN_BUCKET) continue;
+    for (TableGuard::IndexBuckets& entry : guard->indexes) {
         bool current = false;
         for (Index* index : indexes) current = current || index == entry.index;
         if (!current) continue;
@@ -963,7 +964,9 @@ bool FS_Table::peekPassesGuard(unsigned int id, uint32_t end) {
             default:
                 return false;
         }
-        if (bucket >= 0 && static_cast<uint32_t>(bucket) != entry.bucketOf[id]) return false;
+        // A key that is not where its record is filed is damage whichever
+        // read meets it; the guarded read that follows finds it noted.
+        if (bucket >= 0 && !guardFiled(entry, id, static_cast<uint32_t>(bucket))) return false;
     }
     return true;
 }
@@ -977,9 +980,11 @@ bool FS_Table::peekText(unsigned int id, unsigned int column, const unsigned cha
                         bool* ascii) {
     if (dataFile == nullptr || pointerFile == nullptr || text == nullptr || length == nullptr) return false;
     if (column >= schema.count() || schema.at(column)->getType() != FIELD_TEXT) return false;
-    if (guard != nullptr && guard->damaged) return false;
+    // A row check needs the decoded record: such a table is read whole.
+    if (guard != nullptr && (guard->damaged || guard->rowCheck != nullptr)) return false;
     uint32_t offset;
     if (!readSlot(id, &offset) || offset == kRemovedSlot) return false;
+    if (guard != nullptr && !guardSlot(id, offset)) return false;
     uint32_t end;
     if (!peekRecord(offset, schema, &end) || !peekPassesGuard(id, end)) return false;
     *text = peekBytes.data() + peekColumns[column].at;
@@ -1042,6 +1047,8 @@ bool FS_Table::remove(unsigned int id) {
     std::string zero;
     codec::putFixed32(&zero, kRemovedSlot);
     if (!writeAll(pointerFile, zero)) return false;
+    // A walk in progress has counted slots this removal changes.
+    if (guard != nullptr) guard->walking = false;
     bool dec = decCount(0);
     bool inc = incCount(1);
     return dec && inc;
@@ -1052,7 +1059,16 @@ bool FS_Table::remove(unsigned int id) {
 bool FS_Table::moveFirst(unsigned int& id) {
     if (pointerFile == nullptr) return false;
     uint32_t slot;
-    if (!readSlot(0, &slot)) return false;
+    if (!readSlot(0, &slot)) {
+        // An empty pointer file: a walk over no slots, and no live one.
+        if (guard != nullptr && !guard->damaged) {
+            guardWalkStart(kRemovedSlot);
+            if (pointerFile->eof()) guardWalkEnd();
+        }
+        return false;
+    }
+    // Under the guard a walk from here keeps count of the live slots.
+    if (guard != nullptr) guardWalkStart(slot);
     if (slot != kRemovedSlot) {
         id = 0;
         return true;
@@ -1069,13 +1085,18 @@ bool FS_Table::moveNext(unsigned int& id) {
     if (position > 0x7FFFFFFFull || !pointerFile->seek(static_cast<long>(position), SEEK_FROM_START)) return false;
     unsigned int n = id + 1;
     uint32_t slot;
+    // Only a move on from where the walk stands continues it.
+    bool walk = guard != nullptr && guard->walking && guard->walkAt == id && !guard->damaged;
+    if (guard != nullptr && !walk) guard->walking = false;
     while (readWord(pointerFile, &slot)) {
         if (slot != kRemovedSlot) {
+            if (walk && !guardWalkLive(n, slot)) return false;
             id = n;
             return true;
         }
         ++n;
     }
+    if (walk && pointerFile->eof()) guardWalkEnd();
     return false;
 }
 
@@ -1338,19 +1359,28 @@ bool FS_Table::buildHashIndex(wchar_t const* indexName, wchar_t const* fieldName
 
 bool FS_Table::hashIndex_moveFirst(Index& index, wchar_t const* key, unsigned int& id, unsigned int& next) {
     if (pointerFile == nullptr || key == nullptr) return false;
+    unsigned int bucket = static_cast<unsigned int>(hash(key, Index::BUCKETS));
     unsigned int headId, headNext;
-    if (!index.read(static_cast<unsigned int>(hash(key, Index::BUCKETS)), &headId, &headNext)) return false;
+    if (!index.read(bucket, &headId, &headNext)) return false;
+    // Under the guard every chain slot is checked before the lookup relies
+    // on it; damage ends the lookup and stays noted for the caller.
+    if (guard != nullptr && !guardChainSlot(index, bucket, headId, headNext)) return false;
     if (headId == Index::EMPTY) return false;
     uint32_t slot;
     if (!readSlot(headId, &slot)) return false;
     next = headNext;
+    if (guard != nullptr) guardChainAt(index, headNext, bucket);
     if (slot == kRemovedSlot) return hashIndex_moveNext(index, id, next);
     id = headId;
+    if (guard != nullptr) guardReached(&index, id, bucket);
     return true;
 }
 
 bool FS_Table::hashIndex_moveNext(Index& index, unsigned int& id, unsigned int& next) {
     if (pointerFile == nullptr) return false;
+    // The bucket this chain hangs from, when the guard kept it.
+    uint32_t bucket = 0;
+    bool knownBucket = guard != nullptr && next != Index::EMPTY && guardChainBucket(index, next, &bucket);
     // Index::write appends every overflow slot at the end of the file and
     // links it to slots that were there before, so along a sound chain the
     // overflow slot numbers fall strictly and never reach the buckets.  A
@@ -1368,12 +1398,20 @@ bool FS_Table::hashIndex_moveNext(Index& index, unsigned int& id, unsigned int& 
             next = Index::EMPTY;
             return false;
         }
+        if (guard != nullptr && !guardChainSlot(index, next, candidate, after)) {
+            next = Index::EMPTY;
+            return false;
+        }
         if (after != Index::EMPTY && after >= next) after = Index::EMPTY;
         next = after;
         uint32_t slot;
         if (!readSlot(candidate, &slot)) return false;
         if (slot != kRemovedSlot) {
             id = candidate;
+            if (guard != nullptr) {
+                if (knownBucket) guardChainAt(index, next, bucket);
+                guardReached(knownBucket ? &index : nullptr, id, bucket);
+            }
             return true;
         }
     }

@@ -17,10 +17,10 @@
 #include "fscanner/fscommon/stringhelper.h"
 #include "fscanner/fscommon/sync.h"
 #include "fscanner/fscommon/sysfile.h"
+#include "fscanner/fscommon/table_verify.h"
 
 class __recordSet;
 class RecordSet;
-struct TableGuard;
 
 // Writes the 7-bit group encoding of value at the end of buffer[0..size) and
 // returns the index of its first byte (length = size - index).  The table
@@ -223,17 +223,41 @@ public:
 
     // Integrity guard (table_verify.cpp).  The formats carry no checksum, so
     // what can be checked is the agreement of the files with each other.
-    // verify() checks an open table in time linear in its pointer and index
-    // files: whole slots, counts equal to the live and removed slots, live
-    // slots at rising offsets inside the records, and every index a sound set
-    // of chains holding each record number exactly once.  Passing or not, it
-    // arms the guard until close(): read() then fails a live record that runs
-    // past the data file, does not end where the next live record starts, or
-    // holds a key that hashes elsewhere than the bucket its index entry is
-    // filed under.  The first failed check is kept as the table's damage; a
-    // damaged table's reads fail.  False with the damage set on a failed
-    // check, false without damage on a closed table.
+    // verify() checks an open table in time independent of its size: whole
+    // slots, stored + deleted equal to the slot count and stored not above
+    // it, the first live slot right behind the header, and every index file
+    // whole slots and at least its buckets.  Passing or not, it arms the
+    // guard until close(), and from then on each operation checks what it
+    // relies on:
+    //  - read() fails a live record whose slot points outside the records,
+    //    that runs past the data file, does not end where the next live
+    //    record starts, or whose key, for any index, is not on the chain of
+    //    its bucket (a record a lookup met under a bucket must hash to that
+    //    bucket; any other is searched on its key's chain); and a record
+    //    the row check (setRowCheck) refuses;
+    //  - hashIndex_moveFirst/moveNext fail a chain slot that names a record
+    //    past the pointer file, an empty slot inside a chain, an empty bucket
+    //    with a chain, and a link outside the overflow slots or not falling;
+    //  - a walk from moveFirst through moveNext to the end of the pointer
+    //    file fails live slots outside the records or not at rising offsets,
+    //    and a stored count other than the live slots it passed;
+    //  - chain searches of one index that add up to an eighth of its size
+    //    check that index whole once, as verifyWhole() does.
+    // The first failed check is kept as the table's damage; a damaged
+    // table's reads fail.  False with the damage set on a failed check,
+    // false without damage on a closed table.
     bool verify();
+    // verify(), then every slot of the pointer file (rising offsets inside
+    // the records, stored count equal to the live slots) and every index
+    // whole (a sound set of chains holding each record number exactly
+    // once), in time linear in those files.
+    bool verifyWhole();
+    // Under the guard: check, called on every record read whole with the
+    // table's own columns, answers null for a sound record or the text of
+    // its failed check, which becomes the damage of the data file.  No
+    // effect before verify(); close() forgets it.  The context is the
+    // caller's and must outlive the table's open state.
+    void setRowCheck(char const* (*check)(void* context, Fields& record), void* context);
     bool isDamaged() const;
     // While the guard is armed the table also keeps its first failed write:
     // an insert or an update that could not be stored (a full disk) fails
@@ -291,7 +315,34 @@ private:
     bool reserveInsert(unsigned int recordBytes);
     // Appends field's encoding to bytes; type 6 adds nothing.
     void encodeValue(Field* field, std::string* bytes);
-    bool verifyIndex(Index& index, uint32_t slots);
+    // The whole check of one index against slots record numbers; on
+    // success entry's bucketOf answers the key checks from then on.
+    bool verifyIndex(TableGuard::IndexBuckets& entry, uint32_t slots);
+    // The guard's check of a live slot: inside the records, the first one
+    // behind the header.  False with the damage noted.
+    bool guardSlot(unsigned int id, uint32_t offset);
+    // offset inside the data file, id a slot of the pointer file, slot one
+    // of index's slots (sizes kept by the guard).
+    bool insideData(uint32_t offset);
+    bool insidePointers(uint32_t id);
+    bool insideIndex(Index& index, uint32_t slot);
+    // The guard's check of index slot (id, next) met on a chain.
+    bool guardChainSlot(Index& index, uint32_t slot, uint32_t id, uint32_t next);
+    // A lookup on bucket's chain goes on at overflow slot next; and the
+    // bucket of a lookup that goes on at next, when one was kept.
+    void guardChainAt(Index& index, uint32_t next, uint32_t bucket);
+    bool guardChainBucket(Index& index, uint32_t next, uint32_t* bucket);
+    // The lookup on index (null: bucket unknown) handed out id under bucket.
+    void guardReached(Index* index, uint32_t id, uint32_t bucket);
+    // Record id, whose key falls in bucket, is filed there in entry's index.
+    bool guardFiled(TableGuard::IndexBuckets& entry, unsigned int id, uint32_t bucket);
+    // guardFiled for every current index, keys taken from record.
+    bool guardKeys(unsigned int id, Fields& record);
+    // A walk starts at slot 0 (firstOffset its slot), passes a live slot,
+    // and reaches the end of the pointer file.
+    void guardWalkStart(uint32_t firstOffset);
+    bool guardWalkLive(unsigned int id, uint32_t offset);
+    bool guardWalkEnd();
     void dropGuard();
 
     AbstractFile* dataFile;

@@ -13,6 +13,18 @@
 //    chain the overflow slot numbers fall;
 //  - the key of a record hashes to the bucket its entries are filed under.
 //
+// What is checked when: verify() tests at open only what costs the same for
+// any size (whole slots, the counts against the slot count, the first slot,
+// every index at least its buckets).  Each read then tests what it relies
+// on: its slot (inside the records), its end against the next slot, the
+// links of every chain a lookup follows, and for every index that its key's
+// chain holds the record (met under that bucket by the lookup, or found by
+// walking the chain).  A walk over the whole pointer file tests the rising
+// offsets and the stored count on its way.  Chain searches that add up to a
+// share of an index's size check that index whole once (verifyIndex) and
+// answer from its map after, so a query that reads every row pays for each
+// index once.  verifyWhole() does all of it at once.
+//
 // A crash breaks some of these (padding, a count behind its slot): a table
 // left by a crash is never verified, since the cache refuses it by its
 // update flag before.
@@ -109,6 +121,15 @@ bool Index::readSlots(unsigned int first, unsigned int count, uint32_t* words) {
 
 // ---- FS_Table ----------------------------------------------------------------
 
+namespace {
+
+// Chain slots a lookup may walk in one index, summed over the reads, before
+// the index is checked whole: an eighth of the index, so that a query that
+// reads every row pays at most that much on top of the one whole check.
+uint64_t searchBudget(unsigned int indexSlots) { return indexSlots / 8u + 4096u; }
+
+}  // namespace
+
 void FS_Table::dropGuard() {
     delete guard;
     guard = nullptr;
@@ -154,20 +175,64 @@ bool FS_Table::noteDamage(wchar_t const* file, char const* check) {
     return false;
 }
 
+void FS_Table::setRowCheck(char const* (*check)(void* context, Fields& record), void* context) {
+    // Without the guard nothing is checked, and a guard made here would
+    // check reads against a header it never measured.
+    if (guard == nullptr) return;
+    guard->rowCheck = check;
+    guard->rowCheckContext = context;
+}
+
 bool FS_Table::verify() {
     if (dataFile == nullptr || pointerFile == nullptr) return false;
     if (guard == nullptr) guard = new TableGuard();
     if (guard->damaged) return false;
     guard->indexes.clear();
+    guard->reachedIndex = nullptr;
+    for (TableGuard::ChainPosition& p : guard->chains) p.index = nullptr;
+    guard->walking = false;
+    guard->header = headerSize();
 
-    uint32_t dataSize = contentSize(dataFile);
     uint32_t slotBytes = contentSize(pointerFile);
     if (slotBytes % kSlotSize != 0) return noteDamage(pointerPath, "pointer file size is not whole slots");
     uint32_t slots = slotBytes / kSlotSize;
-    unsigned int header = headerSize();
+    guard->slots = slots;
+    guard->dataSize = contentSize(dataFile);
+    // The first record, live or removed, starts right behind the header.
+    uint32_t first = kRemovedSlot;
+    if (slots != 0 && schema.count() != 0) {
+        if (!readSlot(0, &first)) return noteDamage(pointerPath, "pointer file cannot be read");
+        if (first != kRemovedSlot && !guardSlot(0, first)) return false;
+    }
+    uint32_t stored = 0, deleted = 0;
+    if (!count(0, &stored) || !count(1, &deleted)) return noteDamage(dataPath, "header counts cannot be read");
+    // The live slots are at most all slots: a larger stored count cannot be
+    // their number, whatever the slots hold.
+    if (stored > slots) return noteDamage(dataPath, "stored count differs from the live slots of the pointer file");
+    if (static_cast<unsigned long long>(stored) + deleted != slots)
+        return noteDamage(dataPath, "deleted count differs from the removed slots of the pointer file");
 
-    // Live slots at rising offsets inside the records; slot 0's record, live
-    // or removed, starts right behind the header.
+    for (Index* index : indexes) {
+        wchar_t const* path = index->getIndexFullPathName();
+        unsigned int total = 0;
+        if (!index->slotCount(&total)) return noteDamage(path, "index file size is not whole slots");
+        if (total < Index::BUCKETS) return noteDamage(path, "index file is shorter than its buckets");
+        TableGuard::IndexBuckets entry;
+        entry.index = index;
+        entry.field = index->getFieldName() != nullptr ? index->getFieldName() : L"";
+        entry.slots = total;
+        guard->indexes.push_back(std::move(entry));
+    }
+    return true;
+}
+
+bool FS_Table::verifyWhole() {
+    if (!verify()) return false;
+    uint32_t dataSize = contentSize(dataFile);
+    uint32_t slots = contentSize(pointerFile) / kSlotSize;
+    unsigned int header = guard->header;
+
+    // Live slots at rising offsets inside the records.
     uint32_t live = 0;
     uint32_t last = 0;
     if (!pointerFile->seek(0, SEEK_FROM_START)) return noteDamage(pointerPath, "pointer file cannot be read");
@@ -183,8 +248,6 @@ bool FS_Table::verify() {
             ++live;
             // Records of a table without columns are empty and share offsets.
             if (schema.count() == 0) continue;
-            if (done + i == 0 && offset != header)
-                return noteDamage(pointerPath, "first record does not start behind the header");
             if (offset < header || offset >= dataSize)
                 return noteDamage(pointerPath, "slot points outside the records of the data file");
             if (live > 1 && offset <= last) return noteDamage(pointerPath, "slots do not point at rising offsets");
@@ -192,19 +255,18 @@ bool FS_Table::verify() {
         }
         done += n;
     }
-    uint32_t stored = 0, deleted = 0;
-    if (!count(0, &stored) || !count(1, &deleted)) return noteDamage(dataPath, "header counts cannot be read");
+    uint32_t stored = 0;
+    if (!count(0, &stored)) return noteDamage(dataPath, "header counts cannot be read");
     if (stored != live) return noteDamage(dataPath, "stored count differs from the live slots of the pointer file");
-    if (static_cast<unsigned long long>(stored) + deleted != slots)
-        return noteDamage(dataPath, "deleted count differs from the removed slots of the pointer file");
 
-    for (Index* index : indexes) {
-        if (!verifyIndex(*index, slots)) return false;
+    for (TableGuard::IndexBuckets& entry : guard->indexes) {
+        if (!verifyIndex(entry, slots)) return false;
     }
     return true;
 }
 
-bool FS_Table::verifyIndex(Index& index, uint32_t slots) {
+bool FS_Table::verifyIndex(TableGuard::IndexBuckets& entry, uint32_t slots) {
+    Index& index = *entry.index;
     wchar_t const* path = index.getIndexFullPathName();
     unsigned int total = 0;
     if (!index.slotCount(&total)) return noteDamage(path, "index file size is not whole slots");
@@ -212,10 +274,8 @@ bool FS_Table::verifyIndex(Index& index, uint32_t slots) {
     std::vector<uint32_t> words(static_cast<size_t>(total) * 2);
     if (!index.readSlots(0, total, words.data())) return noteDamage(path, "index file cannot be read");
 
-    TableGuard::IndexBuckets entry;
-    entry.index = &index;
-    entry.field = index.getFieldName() != nullptr ? index.getFieldName() : L"";
-    entry.bucketOf.assign(slots, TableGuard::UNKNOWN_BUCKET);
+    std::vector<uint32_t>& bucketOf = entry.bucketOf;
+    bucketOf.assign(slots, TableGuard::UNKNOWN_BUCKET);
     std::vector<bool> reached(total - Index::BUCKETS, false);
     uint32_t entries = 0;
     uint32_t overflowReached = 0;
@@ -231,9 +291,8 @@ bool FS_Table::verifyIndex(Index& index, uint32_t slots) {
         for (;;) {
             if (id == Index::EMPTY) return noteDamage(path, "empty slot inside a chain");
             if (id >= slots) return noteDamage(path, "index entry names a record past the pointer file");
-            if (entry.bucketOf[id] != TableGuard::UNKNOWN_BUCKET)
-                return noteDamage(path, "record filed twice in the index");
-            entry.bucketOf[id] = bucket;
+            if (bucketOf[id] != TableGuard::UNKNOWN_BUCKET) return noteDamage(path, "record filed twice in the index");
+            bucketOf[id] = bucket;
             ++entries;
             if (next == Index::EMPTY) break;
             // Overflow slots are appended and linked to older ones, so along
@@ -250,7 +309,161 @@ bool FS_Table::verifyIndex(Index& index, uint32_t slots) {
     }
     if (overflowReached != total - Index::BUCKETS) return noteDamage(path, "overflow slot outside every chain");
     if (entries != slots) return noteDamage(path, "index does not hold every record number");
-    guard->indexes.push_back(std::move(entry));
+    entry.whole = true;
+    return true;
+}
+
+bool FS_Table::guardSlot(unsigned int id, uint32_t offset) {
+    // Records of a table without columns are empty and share offsets.
+    if (schema.count() == 0 || offset == kRemovedSlot) return true;
+    if (id == 0 && offset != guard->header)
+        return noteDamage(pointerPath, "first record does not start behind the header");
+    if (offset < guard->header || !insideData(offset))
+        return noteDamage(pointerPath, "slot points outside the records of the data file");
+    return true;
+}
+
+bool FS_Table::insideData(uint32_t offset) {
+    if (offset < guard->dataSize) return true;
+    guard->dataSize = contentSize(dataFile);
+    return offset < guard->dataSize;
+}
+
+bool FS_Table::insidePointers(uint32_t id) {
+    if (id < guard->slots) return true;
+    guard->slots = contentSize(pointerFile) / kSlotSize;
+    return id < guard->slots;
+}
+
+bool FS_Table::insideIndex(Index& index, uint32_t slot) {
+    for (TableGuard::IndexBuckets& entry : guard->indexes) {
+        if (entry.index != &index) continue;
+        if (slot < entry.slots) return true;
+        unsigned int total = 0;
+        entry.slots = index.slotCount(&total) ? total : 0;
+        return slot < entry.slots;
+    }
+    unsigned int total = 0;
+    return index.slotCount(&total) && slot < total;
+}
+
+bool FS_Table::guardChainSlot(Index& index, uint32_t slot, uint32_t id, uint32_t next) {
+    wchar_t const* path = index.getIndexFullPathName();
+    if (id == Index::EMPTY) {
+        // A bucket is only ever chained behind a first entry; an overflow
+        // slot is only ever written with one.
+        if (slot >= Index::BUCKETS) return noteDamage(path, "empty slot inside a chain");
+        if (next != Index::EMPTY) return noteDamage(path, "empty bucket has a chain");
+        return true;
+    }
+    if (!insidePointers(id)) return noteDamage(path, "index entry names a record past the pointer file");
+    if (next == Index::EMPTY) return true;
+    // Overflow slots are appended and linked to older ones, so along a chain
+    // their numbers fall: this also bounds every walk along a chain.
+    if (next < Index::BUCKETS || !insideIndex(index, next) || (slot >= Index::BUCKETS && next >= slot))
+        return noteDamage(path, "chain link points outside the overflow slots");
+    return true;
+}
+
+void FS_Table::guardChainAt(Index& index, uint32_t next, uint32_t bucket) {
+    if (next == Index::EMPTY) return;
+    for (TableGuard::ChainPosition& p : guard->chains) {
+        if (p.index == &index && p.next == next) {
+            p.bucket = bucket;
+            return;
+        }
+    }
+    TableGuard::ChainPosition& p = guard->chains[guard->nextChain];
+    guard->nextChain = (guard->nextChain + 1) % TableGuard::CHAIN_POSITIONS;
+    p.index = &index;
+    p.next = next;
+    p.bucket = bucket;
+}
+
+bool FS_Table::guardChainBucket(Index& index, uint32_t next, uint32_t* bucket) {
+    for (TableGuard::ChainPosition& p : guard->chains) {
+        if (p.index == &index && p.next == next) {
+            *bucket = p.bucket;
+            // The lookup moves on: the slot is not a position any more.
+            p.index = nullptr;
+            return true;
+        }
+    }
+    return false;
+}
+
+void FS_Table::guardReached(Index* index, uint32_t id, uint32_t bucket) {
+    guard->reachedIndex = index;
+    guard->reachedId = id;
+    guard->reachedBucket = bucket;
+}
+
+bool FS_Table::guardFiled(TableGuard::IndexBuckets& entry, unsigned int id, uint32_t bucket) {
+    char const* const misfiled = "record does not hold the key its index entry is filed under";
+    Index& index = *entry.index;
+    if (guard->reachedIndex == &index && guard->reachedId == id)
+        return bucket == guard->reachedBucket || noteDamage(index.getIndexFullPathName(), misfiled);
+    if (!entry.whole && entry.searched > searchBudget(entry.slots) &&
+        !verifyIndex(entry, contentSize(pointerFile) / kSlotSize))
+        return false;
+    if (entry.whole) {
+        if (id >= entry.bucketOf.size() || entry.bucketOf[id] == TableGuard::UNKNOWN_BUCKET) return true;
+        return entry.bucketOf[id] == bucket || noteDamage(index.getIndexFullPathName(), misfiled);
+    }
+    // The record's number must be on its key's chain.  Every link is checked
+    // before it is followed, so the walk ends within the index's slots.
+    uint32_t slot = bucket;
+    for (;;) {
+        uint32_t candidate, next;
+        ++entry.searched;
+        if (!index.read(slot, &candidate, &next)) return noteDamage(index.getIndexFullPathName(), "index file cannot be read");
+        if (!guardChainSlot(index, slot, candidate, next)) return false;
+        if (candidate == id) return true;
+        if (candidate == Index::EMPTY || next == Index::EMPTY) return noteDamage(index.getIndexFullPathName(), misfiled);
+        slot = next;
+    }
+}
+
+bool FS_Table::guardKeys(unsigned int id, Fields& record) {
+    for (TableGuard::IndexBuckets& entry : guard->indexes) {
+        bool current = false;
+        for (Index* index : indexes) current = current || index == entry.index;
+        if (!current) continue;
+        int bucket = keyBucket(record.name(entry.field.c_str()));
+        if (bucket >= 0 && !guardFiled(entry, id, static_cast<uint32_t>(bucket))) return false;
+    }
+    return true;
+}
+
+void FS_Table::guardWalkStart(uint32_t firstOffset) {
+    guard->walking = true;
+    guard->walkAt = 0;
+    guard->walkLive = firstOffset != kRemovedSlot ? 1 : 0;
+    guard->walkLastOffset = firstOffset;
+}
+
+bool FS_Table::guardWalkLive(unsigned int id, uint32_t offset) {
+    ++guard->walkLive;
+    guard->walkAt = id;
+    if (schema.count() == 0) return true;
+    if (offset < guard->header || !insideData(offset)) {
+        guard->walking = false;
+        return noteDamage(pointerPath, "slot points outside the records of the data file");
+    }
+    if (guard->walkLive > 1 && offset <= guard->walkLastOffset) {
+        guard->walking = false;
+        return noteDamage(pointerPath, "slots do not point at rising offsets");
+    }
+    guard->walkLastOffset = offset;
+    return true;
+}
+
+bool FS_Table::guardWalkEnd() {
+    guard->walking = false;
+    uint32_t stored = 0;
+    if (!count(0, &stored)) return noteDamage(dataPath, "header counts cannot be read");
+    if (stored != guard->walkLive)
+        return noteDamage(dataPath, "stored count differs from the live slots of the pointer file");
     return true;
 }
 
@@ -261,6 +474,7 @@ bool FS_Table::guardedRead(unsigned int id, Fields& record) {
     // unguarded read answers them.
     if (dataFile == nullptr || pointerFile == nullptr || !readSlot(id, &offset) || offset == kRemovedSlot)
         return readRecord(id, record);
+    if (!guardSlot(id, offset)) return false;
     if (!readRecord(id, record)) {
         // A type-6 column is never stored, so its read fails on any record.
         for (unsigned int i = 0; i < record.count(); ++i)
@@ -273,21 +487,19 @@ bool FS_Table::guardedRead(unsigned int id, Fields& record) {
     uint32_t nextOffset = kRemovedSlot;
     if (id != 0xFFFFFFFFu && readSlot(id + 1, &nextOffset) && nextOffset != kRemovedSlot && nextOffset != end)
         return noteDamage(dataPath, "record does not end where the next record starts");
-    for (TableGuard::IndexBuckets const& entry : guard->indexes) {
-        if (id >= entry.bucketOf.size() || entry.bucketOf[id] == TableGuard::UNKNOWN_BUCKET) continue;
-        bool current = false;
-        for (Index* index : indexes) current = current || index == entry.index;
-        if (!current) continue;
-        int bucket = keyBucket(record.name(entry.field.c_str()));
-        if (bucket >= 0 && static_cast<uint32_t>(bucket) != entry.bucketOf[id])
-            return noteDamage(entry.index->getIndexFullPathName(),
-                              "record does not hold the key its index entry is filed under");
+    if (!guardKeys(id, record)) return false;
+    if (guard->rowCheck != nullptr) {
+        char const* failed = guard->rowCheck(guard->rowCheckContext, record);
+        if (failed != nullptr) return noteDamage(dataPath, failed);
     }
     return true;
 }
 
 void FS_Table::guardInsert(Fields& record, unsigned int id) {
+    // The walk's count no longer matches what it has seen.
+    guard->walking = false;
     for (TableGuard::IndexBuckets& entry : guard->indexes) {
+        if (!entry.whole) continue;
         if (entry.bucketOf.size() <= id) entry.bucketOf.resize(static_cast<size_t>(id) + 1, TableGuard::UNKNOWN_BUCKET);
         int bucket = keyBucket(record.name(entry.field.c_str()));
         entry.bucketOf[id] = bucket >= 0 ? static_cast<uint32_t>(bucket) : TableGuard::UNKNOWN_BUCKET;

@@ -1,6 +1,8 @@
 // State of a table's integrity guard (FS_Table::verify): the first damage
-// found, and for every hash index the bucket that each record number is filed
-// under, so that a read can tell a record whose key no longer fits its entry.
+// found, what the reads have learnt of each hash index, the lookup that
+// handed out the record being read, and the walk over the pointer file in
+// progress.  The guard checks each read on what that read relies on, so
+// that a query that reads a few rows pays for a few rows.
 #ifndef FSCANNER_FSCOMMON_TABLE_VERIFY_H
 #define FSCANNER_FSCOMMON_TABLE_VERIFY_H
 
@@ -8,6 +10,7 @@
 #include <string>
 #include <vector>
 
+class Fields;
 class Index;
 
 struct TableGuard {
@@ -16,12 +19,42 @@ struct TableGuard {
     static constexpr uint32_t UNKNOWN_BUCKET = 0xFFFFFFFFu;
 
     struct IndexBuckets {
-        // Compared only, never followed: the table's own list says which
-        // indexes are still there.
+        // Compared only, never followed unless the table's own list still
+        // holds it: that list says which indexes are still there.
         Index* index;
         std::wstring field;
+        // Chain slots walked so far to find a read record under its key.
+        // Past a share of the index's size the whole index is checked once
+        // and bucketOf answers from then on: a query that reads every row
+        // pays for the index once, not a chain per row.
+        uint64_t searched = 0;
+        bool whole = false;
+        // Slots of the index file when last measured: files only grow while
+        // open, so a slot below it needs no new measure.
+        uint32_t slots = 0;
+        // Valid when whole: the bucket each record number is filed under.
         std::vector<uint32_t> bucketOf;
     };
+
+    // Where a chain being walked by a lookup came from: the overflow slot
+    // the lookup goes on with, and the bucket whose chain it belongs to.  In
+    // a sound index every overflow slot is in one chain only, so the pair
+    // (index, slot) names the bucket of a record met there; damage that puts
+    // a slot into two chains shows as a key that hashes elsewhere.
+    struct ChainPosition {
+        Index* index = nullptr;
+        uint32_t next = 0;
+        uint32_t bucket = 0;
+    };
+    static const unsigned int CHAIN_POSITIONS = 8;
+
+    // headerSize() of the table, kept while it is open: the schema does not
+    // change under an open table.
+    uint32_t header = 0;
+    // Sizes of the data file in bytes and of the pointer file in slots when
+    // last measured; measured again only when a check reaches past them.
+    uint32_t dataSize = 0;
+    uint32_t slots = 0;
 
     bool damaged = false;
     std::wstring file;
@@ -32,6 +65,26 @@ struct TableGuard {
     int writeError = 0;
     std::wstring writeFile;
     std::vector<IndexBuckets> indexes;
+
+    // The record the last lookup handed out and the bucket it was met under.
+    Index* reachedIndex = nullptr;
+    uint32_t reachedId = 0;
+    uint32_t reachedBucket = 0;
+    ChainPosition chains[CHAIN_POSITIONS];
+    unsigned int nextChain = 0;
+
+    // A walk with moveFirst and moveNext over the whole pointer file: the
+    // last number it stood on, its live slots and the last live offset.  Any
+    // change to the table, or a move that does not continue it, ends the
+    // walk's bookkeeping; one that reaches the end checks the stored count.
+    bool walking = false;
+    uint32_t walkAt = 0;
+    uint32_t walkLive = 0;
+    uint32_t walkLastOffset = 0;
+
+    // The owner's check of every record read whole (FS_Table::setRowCheck).
+    char const* (*rowCheck)(void* context, Fields& record) = nullptr;
+    void* rowCheckContext = nullptr;
 };
 
 #endif
