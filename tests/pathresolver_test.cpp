@@ -345,6 +345,55 @@ TEST(IsValidPath, FirstFileSystemInOrderDecides) {
     EXPECT_TRUE(helper.isValidPath(map, fileSystems, 4, L"/x:/y:/z", false));
 }
 
+// Every prefix of the path joined to each file system in turn and looked up,
+// the longest first: the rule isValidPath answers, stated the plain way.
+bool validByPrefixLookup(PathHelper::DriveMap& map, const std::set<std::wstring>& fileSystems, unsigned int mask,
+                         const std::wstring& path) {
+    if (mask == 0) return false;
+    for (const std::wstring& fileSystem : fileSystems) {
+        for (size_t length = path.size(); length > 0; --length) {
+            auto hit = map.find(path.substr(0, length) + fileSystem);
+            if (hit != map.end()) return (mask & hit->second.getDriveType()) != 0;
+        }
+    }
+    return false;
+}
+
+TEST(IsValidPath, AgreesWithTheLookupOfEveryPrefixOnNestedAndOverlappingDrives) {
+    // Keys whose prefix ends inside another key's file system name, file
+    // system names that end one another ("fs", "xfs"), an empty name, drives
+    // nested on drives, and paths shorter than some prefixes.
+    const wchar_t* prefixes[] = {L"/:", L"/x:", L"/x:/y:", L"/x:/yy", L"/:/usr", L"/:/usr/lib", L"/:/usrx", L"/x"};
+    const wchar_t* names[] = {L"fs", L"xfs", L"ext4", L"", L"s"};
+    const DriveType types[] = {dtLocal, dtRemote, dtAutoFS, dtReserved8};
+    std::set<std::wstring> fileSystems(std::begin(names), std::end(names));
+    const wchar_t* paths[] = {L"/:/usr/lib/x", L"/:/usr", L"/:/usrx/a", L"/x:/y:/z", L"/x:/yy", L"/x:/y",
+                              L"/x", L"/", L"", L"/:fs", L"/x:xfs/q", L"/:/usr/libxfs"};
+    PathHelper helper;
+    unsigned int seed = 7;
+    for (int round = 0; round < 200; ++round) {
+        PathHelper::DriveMap map;
+        for (const wchar_t* prefix : prefixes)
+            for (const wchar_t* name : names) {
+                seed = seed * 1103515245u + 12345u;
+                if ((seed >> 16) % 3 != 0) continue;
+                DriveType type = types[(seed >> 8) % 4];
+                map.insert(std::make_pair(std::wstring(prefix) + name, DriveInfo(prefix, type, name)));
+            }
+        std::set<std::wstring> some;
+        for (const std::wstring& name : fileSystems) {
+            seed = seed * 1103515245u + 12345u;
+            if ((seed >> 16) % 4 != 0) some.insert(name);
+        }
+        for (size_t p = 0; p < sizeof paths / sizeof paths[0]; ++p)
+            for (unsigned int mask : {1u, 2u, 4u, 8u, 27u, 31u, 0x3fu}) {
+                EXPECT_EQ(validByPrefixLookup(map, some, mask, paths[p]),
+                          helper.isValidPath(map, some, mask, paths[p], false))
+                    << "round " << round << " path #" << p << " mask " << mask;
+            }
+    }
+}
+
 // --- pathDriveAccumulator -----------------------------------------------------------
 
 namespace {

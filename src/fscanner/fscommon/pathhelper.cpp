@@ -300,13 +300,26 @@ bool PathHelper::isValidPath(DriveMap& driveMap, std::set<std::wstring>& fileSys
     if (!path) return false;
     // File systems are the outer loop: the first one in order with any
     // matching prefix decides, even if a later one would match a longer one.
+    // Within one file system the longest prefix wins.  The drive keys are
+    // few and the path long, so each key is split into prefix and file
+    // system and compared with the path, rather than every prefix of the path
+    // being joined to the file system and looked up: the same answer with no
+    // string built per try (this runs for every candidate of every query).
+    size_t pathLength = wcslen(path);
     for (const std::wstring& fileSystem : fileSystems) {
-        std::wstring prefix(path);
-        while (!prefix.empty()) {
-            DriveMap::iterator hit = driveMap.find(prefix + fileSystem);
-            if (hit != driveMap.end()) return (mask & hit->second.getDriveType()) != 0;
-            prefix.erase(prefix.size() - 1);
+        DriveInfo* best = nullptr;
+        size_t bestLength = 0;
+        for (DriveMap::value_type& entry : driveMap) {
+            const std::wstring& key = entry.first;
+            if (key.size() <= fileSystem.size()) continue;
+            size_t prefixLength = key.size() - fileSystem.size();
+            if (prefixLength > pathLength || prefixLength <= bestLength) continue;
+            if (key.compare(prefixLength, std::wstring::npos, fileSystem) != 0) continue;
+            if (wmemcmp(key.data(), path, prefixLength) != 0) continue;
+            best = &entry.second;
+            bestLength = prefixLength;
         }
+        if (best != nullptr) return (mask & best->getDriveType()) != 0;
     }
     return false;
 }
