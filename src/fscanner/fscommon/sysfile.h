@@ -99,8 +99,9 @@ private:
 // the logical size (every byte below the logical size rounded up to the step,
 // but not past the allocated size, is backed; open() backs the holes of a
 // file that has any).  The step is a page for a small file and grows with
-// the content, a 32nd of it up to RESERVE_STEP_MAX.  A full disk thus refuses the write (0 bytes, errno
-// set) and leaves the file as it was, still mapped.
+// the content, a 32nd of it up to RESERVE_STEP_MAX.  A full disk thus
+// refuses the write (0 bytes, errno set) and leaves the file as it was,
+// still mapped.
 //
 // Resident pages: every page of the mapping that a read or write touched
 // stays in the process's resident set until it is unmapped, so a pass over a
@@ -108,10 +109,11 @@ private:
 // per page that an access made resident (with the neighbours a read fault
 // maps along); once these pass RESIDENT_BUDGET, it lets go of the whole
 // mapping's pages (MADV_DONTNEED) and starts counting anew.  A small set of
-// pages used again and again (an index's buckets) counts once.  On a shared file mapping that
-// drops only the process's page table entries: written bytes stay in the
-// page cache, dirty, and reach the file as before; the next access faults
-// the page back in from the cache.  Nothing on disk, and no sync, changes.
+// pages used again and again (an index's buckets) counts once.  On a shared
+// file mapping that drops only the process's page table entries: written
+// bytes stay in the page cache, dirty, and reach the file as before; the
+// next access faults the page back in from the cache.  Nothing on disk, and
+// no sync, changes.
 class LinuxMmFile : public AbstractMmFile {
 public:
     static const uint32_t CHUNK = 0x1000000;
