@@ -8,11 +8,13 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
 #include <cstring>
 #include <cwchar>
+#include <new>
 
 #include "base/kelmem.h"
 #include "fscanner/fscommon/env.h"
@@ -33,11 +35,26 @@ bool narrowName(wchar_t const* wide, char (&out)[4096]) {
     return true;
 }
 
+// The reservation step for content that reaches contentEnd: RESERVE_STEP
+// while the content is small, a 32nd of it (as a power of two) as it grows,
+// at most RESERVE_STEP_MAX.  A file then takes some 32 reservation calls
+// each time it doubles instead of one per page, and holds at most a 32nd
+// more than its content (a small one, a page) reserved ahead: a disk that
+// holds the content with a few percent to spare holds the reservations.
+uint64_t reserveStep(uint64_t contentEnd) {
+    uint64_t step = LinuxMmFile::RESERVE_STEP;
+    while (step < LinuxMmFile::RESERVE_STEP_MAX && step * 2 * 32 <= contentEnd) step *= 2;
+    return step;
+}
+
 // End, exclusive, of the bytes that are backed on disk for a file whose
 // content reaches contentEnd inside an allocation of allocated bytes: the
-// content rounded up to the reservation step, never past the allocation.
+// content rounded up to its reservation step, never past the allocation.
+// The step only grows with the content and each step divides the next, so
+// the end never falls as the content grows: what lies below the end for the
+// old content is below it for the new, and only the difference is reserved.
 uint64_t reservedEnd(uint64_t contentEnd, uint64_t allocated) {
-    const uint64_t step = LinuxMmFile::RESERVE_STEP;
+    const uint64_t step = reserveStep(contentEnd);
     uint64_t rounded = (contentEnd + step - 1) / step * step;
     return rounded < allocated ? rounded : allocated;
 }
@@ -84,6 +101,25 @@ bool rangeIsAllocated(int fd, uint64_t from, uint64_t to) {
     }
     return true;
 }
+
+// log2 of the system's page size, asked once.
+unsigned int pageShift() {
+    static const unsigned int shift = [] {
+        long page = sysconf(_SC_PAGESIZE);
+        unsigned int bits = 12;
+        if (page > 0) {
+            bits = 0;
+            while ((1L << (bits + 1)) <= page) ++bits;
+        }
+        return bits;
+    }();
+    return shift;
+}
+
+// Pages a read fault maps at once when the page cache holds them (the
+// kernel's fault-around, 64 KiB by default): a read that jumps counts them
+// all, since they all become resident.
+const uint32_t kFaultAroundPages = 16;
 
 }  // namespace
 
@@ -169,7 +205,7 @@ bool StdFile::size(unsigned int* result) {
 
 LinuxMmFile::LinuxMmFile(char const* fileName)
     : fd(-1), logical(0), allocated(0), position(0), address(kUnmapped), eofFlag(0), name(nullptr),
-      written(false) {
+      written(false), touchedPages(0), lastPage(~0u), mappedLength(0) {
     if (fileName != nullptr) name = i_strdup(fileName);
 }
 
@@ -281,7 +317,10 @@ unsigned int LinuxMmFile::read(void* buffer, unsigned int length) {
         copied = length;
         eofFlag = 0;
     }
-    if (copied != 0) std::memcpy(buffer, address + position, copied);
+    if (copied != 0) {
+        std::memcpy(buffer, address + position, copied);
+        touched(position, copied, true);
+    }
     position += copied;
     return copied;
 }
@@ -294,6 +333,7 @@ unsigned int LinuxMmFile::write(void* buffer, unsigned int length) {
     if (length != 0) {
         std::memcpy(address + position, buffer, length);
         written = true;
+        touched(position, length, false);
     }
     position += length;
     return length;
@@ -371,19 +411,70 @@ bool LinuxMmFile::grow(unsigned int length, uint64_t contentEnd) {
     return true;
 }
 
+bool LinuxMmFile::markPage(uint32_t page) {
+    uint64_t bit = 1ull << (page & 63);
+    uint64_t& word = touchedMap[page >> 6];
+    if (word & bit) return false;
+    word |= bit;
+    ++touchedPages;
+    return true;
+}
+
+void LinuxMmFile::touched(uint32_t from, unsigned int length, bool reading) {
+    const unsigned int shift = pageShift();
+    uint32_t first = from >> shift;
+    uint32_t last = static_cast<uint32_t>((static_cast<uint64_t>(from) + length - 1) >> shift);
+    if (first == lastPage && last == lastPage) return;
+    lastPage = last;
+    const uint64_t pages = static_cast<uint64_t>(touchedMap.size()) * 64;
+    for (uint32_t page = first; page <= last && page < pages; ++page) {
+        if (!markPage(page) || !reading) continue;
+        // The read faults, and the fault maps the cached neighbours in its
+        // aligned block too.
+        uint32_t block = page & ~(kFaultAroundPages - 1);
+        for (uint32_t other = block; other < block + kFaultAroundPages && other < pages; ++other) markPage(other);
+    }
+    uint32_t budget = RESIDENT_BUDGET >> shift;
+    if (touchedPages <= (budget != 0 ? budget : 1)) return;
+    // Called directly, not through Env: the advice changes neither the file
+    // nor what a read returns, and its failure (the pages stay) is harmless,
+    // so a wrapper has nothing to inject or observe here.
+    ::madvise(address, mappedLength, MADV_DONTNEED);
+    std::fill(touchedMap.begin(), touchedMap.end(), 0);
+    touchedPages = 0;
+    lastPage = ~0u;
+}
+
 bool LinuxMmFile::mapFile() {
     if (fd == -1) return false;
     if (address != kUnmapped) unMapFile();
     unsigned int onDisk = 0;
     if (!size(&onDisk)) return false;
     Env* env = Env::Current();
+    mappedLength = 0;
     if (allocated > onDisk) {
         void* p = env->mapFile(nullptr, allocated, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
         address = (p == MAP_FAILED) ? kUnmapped : static_cast<char*>(p);
+        if (address != kUnmapped) mappedLength = allocated;
     }
     if (address == kUnmapped && onDisk != 0) {
         void* p = env->mapFile(nullptr, onDisk, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
         address = (p == MAP_FAILED) ? kUnmapped : static_cast<char*>(p);
+        if (address != kUnmapped) mappedLength = onDisk;
+    }
+    // A new mapping has nothing resident.  A failed allocation of the bits
+    // leaves none, and then nothing is ever dropped: the file works as
+    // before, only larger in memory.
+    touchedPages = 0;
+    lastPage = ~0u;
+    touchedMap.clear();
+    if (mappedLength != 0) {
+        size_t pages = (mappedLength + (static_cast<size_t>(1) << pageShift()) - 1) >> pageShift();
+        try {
+            touchedMap.assign((pages + 63) / 64, 0);
+        } catch (const std::bad_alloc&) {
+            touchedMap.clear();
+        }
     }
     return address != kUnmapped;
 }

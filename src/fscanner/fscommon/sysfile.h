@@ -14,6 +14,7 @@
 
 #include <cstdint>
 #include <cstdio>
+#include <vector>
 
 const int SEEK_FROM_START = 1;
 const int SEEK_FROM_CURRENT = 2;
@@ -97,16 +98,41 @@ private:
 // extension, and the space is reserved in RESERVE_STEP steps just ahead of
 // the logical size (every byte below the logical size rounded up to the step,
 // but not past the allocated size, is backed; open() backs the holes of a
-// file that has any).  A full disk thus refuses the write (0 bytes, errno
-// set) and leaves the file as it was, still mapped.
+// file that has any).  The step is a page for a small file and grows with
+// the content, a 32nd of it up to RESERVE_STEP_MAX.  A full disk thus
+// refuses the write (0 bytes, errno set) and leaves the file as it was,
+// still mapped.
+//
+// Resident pages: every page of the mapping that a read or write touched
+// stays in the process's resident set until it is unmapped, so a pass over a
+// large table would hold the whole file resident.  The object keeps a bit
+// per page that an access made resident (with the neighbours a read fault
+// maps along); once these pass RESIDENT_BUDGET, it lets go of the whole
+// mapping's pages (MADV_DONTNEED) and starts counting anew.  A small set of
+// pages used again and again (an index's buckets) counts once.  On a shared
+// file mapping that drops only the process's page table entries: written
+// bytes stay in the page cache, dirty, and reach the file as before; the
+// next access faults the page back in from the cache.  Nothing on disk, and
+// no sync, changes.
 class LinuxMmFile : public AbstractMmFile {
 public:
     static const uint32_t CHUNK = 0x1000000;
-    // Granule of the disk space reservation: a page, the unit in which a
-    // store through the mapping dirties the file anyway.  Reserving further
-    // ahead would make a cache that fits fail on a small file system; one
-    // reservation call still serves many record writes.
+    // Smallest granule of the disk space reservation: a page, the unit in
+    // which a store through the mapping dirties the file anyway.  Reserving
+    // further ahead of a small file would make a cache that fits fail on a
+    // small file system; one reservation call still serves many record
+    // writes.
     static const uint32_t RESERVE_STEP = 0x1000;
+    // Largest granule: a large file reserves a 32nd of its content ahead,
+    // but never more than this, so that a file that has grown large does not
+    // pay a reservation call per page, and the space it holds beyond its
+    // content until close stays small beside it.
+    static const uint32_t RESERVE_STEP_MAX = 0x100000;
+    // Bytes of touched pages a mapping may hold resident before they are
+    // dropped (see above).  Small beside the files, large beside a page: a
+    // pass faults each page once either way, and a drop costs one call per
+    // this many bytes.
+    static const uint32_t RESIDENT_BUDGET = 0x200000;
 
     // Copies name (kelm_malloc); null leaves the object nameless.
     explicit LinuxMmFile(char const* name);
@@ -173,6 +199,11 @@ private:
     // content whose bytes reach contentEnd, reserving up to there; the
     // logical size is the caller's to move.
     bool grow(unsigned int length, uint64_t contentEnd);
+    // Marks the pages that an access of length bytes at from makes resident
+    // and drops the mapping's resident pages once they pass the budget.
+    void touched(uint32_t from, unsigned int length, bool reading);
+    // Sets the page's bit; true when it was clear.
+    bool markPage(uint32_t page);
 
     int32_t fd;
     uint32_t logical;
@@ -185,6 +216,14 @@ private:
     // growth) since it was opened or created: only such a file is synced
     // and truncated at close.
     bool written;
+    // One bit per page of the mapping, set when an access may have made it
+    // resident since the mapping was made or last dropped (an upper bound);
+    // touchedPages counts the set bits.  lastPage is the page of the last
+    // access: most accesses stay in it and need no look at the bits.
+    std::vector<uint64_t> touchedMap;
+    uint32_t touchedPages;
+    uint32_t lastPage;
+    size_t mappedLength;  // bytes of the current mapping, 0 when none
 };
 
 #endif
