@@ -205,7 +205,8 @@ bool StdFile::size(unsigned int* result) {
 
 LinuxMmFile::LinuxMmFile(char const* fileName)
     : fd(-1), logical(0), allocated(0), position(0), address(kUnmapped), eofFlag(0), name(nullptr),
-      written(false), touchedPages(0), lastPage(~0u), mappedLength(0) {
+      written(false), touchedPages(0), lastPage(~0u), passPages(0), readPages(0), refaultedPages(0),
+      budgetPages(0), mappedLength(0) {
     if (fileName != nullptr) name = i_strdup(fileName);
 }
 
@@ -411,6 +412,16 @@ bool LinuxMmFile::grow(unsigned int length, uint64_t contentEnd) {
     return true;
 }
 
+void LinuxMmFile::noteRead(uint32_t page) {
+    if ((page >> 6) >= readMap.size()) return;
+    uint64_t bit = 1ull << (page & 63);
+    uint64_t& word = readMap[page >> 6];
+    if (word & bit) return;
+    word |= bit;
+    ++readPages;
+    if ((page >> 6) < droppedMap.size() && (droppedMap[page >> 6] & bit) != 0) ++refaultedPages;
+}
+
 bool LinuxMmFile::markPage(uint32_t page) {
     uint64_t bit = 1ull << (page & 63);
     uint64_t& word = touchedMap[page >> 6];
@@ -425,23 +436,55 @@ void LinuxMmFile::touched(uint32_t from, unsigned int length, bool reading) {
     uint32_t first = from >> shift;
     uint32_t last = static_cast<uint32_t>((static_cast<uint64_t>(from) + length - 1) >> shift);
     if (first == lastPage && last == lastPage) return;
+    // Accesses that move on from where the last one ended, or close behind
+    // it, make a pass; any other jump ends it.
+    if (lastPage != ~0u && first >= lastPage && first <= lastPage + kFaultAroundPages)
+        passPages += last - lastPage;
+    else
+        passPages = 0;
     lastPage = last;
     const uint64_t pages = static_cast<uint64_t>(touchedMap.size()) * 64;
     for (uint32_t page = first; page <= last && page < pages; ++page) {
+        if (reading) noteRead(page);
         if (!markPage(page) || !reading) continue;
         // The read faults, and the fault maps the cached neighbours in its
         // aligned block too.
         uint32_t block = page & ~(kFaultAroundPages - 1);
         for (uint32_t other = block; other < block + kFaultAroundPages && other < pages; ++other) markPage(other);
     }
-    uint32_t budget = RESIDENT_BUDGET >> shift;
-    if (touchedPages <= (budget != 0 ? budget : 1)) return;
+    const uint32_t baseBudget = (RESIDENT_BUDGET >> shift) != 0 ? RESIDENT_BUDGET >> shift : 1;
+    if (budgetPages == 0) budgetPages = baseBudget;
+    if (touchedPages <= baseBudget) return;
+    // A pass over the file (a whole-index check after lookups at random, a
+    // read-back after a build) keeps no more than the first budget, however
+    // far lookups at random have raised the file's own.
+    if (touchedPages <= budgetPages && passPages < baseBudget) return;
+    // Most of what was touched since the last drop had been dropped before:
+    // the file is read at random, and a drop would only bring the same
+    // pages back through faults.  Let it keep more instead.
+    // Only a file that is not being written grows: a build reads its own
+    // rows back at random too, and its files grow without bound.
+    if (!written && passPages < baseBudget && refaultedPages * 2 > readPages &&
+        budgetPages < (RESIDENT_BUDGET_MAX >> shift)) {
+        budgetPages *= 2;
+        return;
+    }
     // Called directly, not through Env: the advice changes neither the file
     // nor what a read returns, and its failure (the pages stay) is harmless,
     // so a wrapper has nothing to inject or observe here.
     ::madvise(address, mappedLength, MADV_DONTNEED);
+    // Without room for the history the budget simply stays as it is.
+    try {
+        if (droppedMap.size() != readMap.size()) droppedMap.assign(readMap.size(), 0);
+        for (size_t i = 0; i < readMap.size(); ++i) droppedMap[i] |= readMap[i];
+    } catch (const std::bad_alloc&) {
+        droppedMap.clear();
+    }
     std::fill(touchedMap.begin(), touchedMap.end(), 0);
+    std::fill(readMap.begin(), readMap.end(), 0);
     touchedPages = 0;
+    readPages = 0;
+    refaultedPages = 0;
     lastPage = ~0u;
 }
 
@@ -466,14 +509,21 @@ bool LinuxMmFile::mapFile() {
     // leaves none, and then nothing is ever dropped: the file works as
     // before, only larger in memory.
     touchedPages = 0;
+    readPages = 0;
+    refaultedPages = 0;
+    passPages = 0;
     lastPage = ~0u;
     touchedMap.clear();
+    readMap.clear();
+    droppedMap.clear();
     if (mappedLength != 0) {
         size_t pages = (mappedLength + (static_cast<size_t>(1) << pageShift()) - 1) >> pageShift();
         try {
             touchedMap.assign((pages + 63) / 64, 0);
+            readMap.assign((pages + 63) / 64, 0);
         } catch (const std::bad_alloc&) {
             touchedMap.clear();
+            readMap.clear();
         }
     }
     return address != kUnmapped;

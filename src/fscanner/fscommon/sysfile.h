@@ -109,7 +109,13 @@ private:
 // per page that an access made resident (with the neighbours a read fault
 // maps along); once these pass RESIDENT_BUDGET, it lets go of the whole
 // mapping's pages (MADV_DONTNEED) and starts counting anew.  A small set of
-// pages used again and again (an index's buckets) counts once.  On a shared
+// pages used again and again (an index's buckets) counts once.  A file read
+// at random (the directories table while paths are rebuilt) would fault the
+// same pages back after every drop: when more than half of the pages read
+// since the last drop had been read and dropped before, the file's budget doubles
+// instead, up to RESIDENT_BUDGET_MAX, so a working set that fits stays; a
+// pass over the file, and a file being written, are still held to the first
+// budget.  On a shared
 // file mapping that drops only the process's page table entries: written
 // bytes stay in the page cache, dirty, and reach the file as before; the
 // next access faults the page back in from the cache.  Nothing on disk, and
@@ -133,6 +139,8 @@ public:
     // pass faults each page once either way, and a drop costs one call per
     // this many bytes.
     static const uint32_t RESIDENT_BUDGET = 0x200000;
+    // Largest budget a file read at random grows to (see above).
+    static const uint32_t RESIDENT_BUDGET_MAX = 0x1000000;
 
     // Copies name (kelm_malloc); null leaves the object nameless.
     explicit LinuxMmFile(char const* name);
@@ -204,6 +212,9 @@ private:
     void touched(uint32_t from, unsigned int length, bool reading);
     // Sets the page's bit; true when it was clear.
     bool markPage(uint32_t page);
+    // Notes a page read since the last drop, and whether it had been read
+    // and dropped before.
+    void noteRead(uint32_t page);
 
     int32_t fd;
     uint32_t logical;
@@ -223,6 +234,20 @@ private:
     std::vector<uint64_t> touchedMap;
     uint32_t touchedPages;
     uint32_t lastPage;
+    // Pages the current pass has moved over (accesses each starting where
+    // the last ended or just behind it); 0 after any other jump.
+    uint32_t passPages;
+    // Pages read since the last drop (readPages of them), pages read and
+    // then dropped at some earlier drop of this mapping, how many of the
+    // pages read since the last drop are among those, and the budget in
+    // pages (0 until the first access sets it from the page size).  Writes
+    // do not count: a table written and then read back in one pass must not
+    // look like a file read at random.
+    std::vector<uint64_t> readMap;
+    uint32_t readPages;
+    std::vector<uint64_t> droppedMap;
+    uint32_t refaultedPages;
+    uint32_t budgetPages;
     size_t mappedLength;  // bytes of the current mapping, 0 when none
 };
 
