@@ -1107,14 +1107,7 @@ public:
             printer.print(path, name);
             return 0;
         }
-        FsFileInfo info;
-        info.setFilePath(path);
-        info.setFileName(name);
-        info.setFileSize(size);
-        info.setFileAttr(attr);
-        info.setCRC32(crc32);
-        info.setQ32(q32);
-        info.setMD5(md5);
+        FsFileInfo info = fileInfoOf(path, name, size, attr, md5, crc32, q32);
         printer.print(info);
         return 0;
     }

@@ -574,6 +574,42 @@ bool FS_Table::readSlot(unsigned int id, uint32_t* offset) {
     return readWord(pointerFile, offset);
 }
 
+namespace {
+
+// A stored text's bytes followed by zeros: the lenient UTF-8 decoder needs a
+// zero behind the text and may look a few bytes past a sequence cut short,
+// so the padding keeps it inside the block whatever the bytes say.  Short
+// texts stay on the stack, long ones take a heap block.
+class PaddedText {
+public:
+    PaddedText() = default;
+    PaddedText(const PaddedText&) = delete;
+    PaddedText& operator=(const PaddedText&) = delete;
+    ~PaddedText() {
+        if (bytes != local) kelm_free(bytes);
+    }
+    // Room for length bytes, all zero; false when the heap refuses.
+    bool make(uint32_t length) {
+        if (length > kInlineTextBytes) {
+            bytes = static_cast<unsigned char*>(kelm_malloc(length + 1 + kPad));
+            if (bytes == nullptr) {
+                bytes = local;
+                return false;
+            }
+        }
+        std::memset(bytes, 0, (length > kInlineTextBytes ? length : kInlineTextBytes) + 1 + kPad);
+        return true;
+    }
+    unsigned char* data() { return bytes; }
+
+private:
+    static const unsigned int kPad = 8;
+    unsigned char local[kInlineTextBytes + 1 + kPad];
+    unsigned char* bytes = local;
+};
+
+}  // namespace
+
 bool FS_Table::storeText(TextField* field, const unsigned char* bytes, uint32_t length) {
     if (!growScratch(length + 1)) return false;
     // The decoder needs a zero behind the bytes and may look a few bytes past
@@ -583,17 +619,10 @@ bool FS_Table::storeText(TextField* field, const unsigned char* bytes, uint32_t 
         for (uint32_t i = 0; i < length; ++i) scratch[i] = static_cast<wchar_t>(bytes[i]);
         scratch[length] = L'\0';
     } else {
-        const unsigned int pad = 8;
-        unsigned char local[kInlineTextBytes + 1 + 8];
-        unsigned char* copy = local;
-        if (length > kInlineTextBytes) {
-            copy = static_cast<unsigned char*>(kelm_malloc(length + 1 + pad));
-            if (copy == nullptr) return false;
-        }
-        std::memset(copy, 0, (length > kInlineTextBytes ? length : kInlineTextBytes) + 1 + pad);
-        if (length != 0) std::memcpy(copy, bytes, length);
-        utils::utf8ToWideChar(scratch, scratchCapacity, copy);
-        if (copy != local) kelm_free(copy);
+        PaddedText copy;
+        if (!copy.make(length)) return false;
+        if (length != 0) std::memcpy(copy.data(), bytes, length);
+        utils::utf8ToWideChar(scratch, scratchCapacity, copy.data());
     }
     field->value(scratch);
     return true;
@@ -659,20 +688,10 @@ bool FS_Table::readValue(Field* field) {
                 if (dataFile->read(buf, 2) != 2) return false;
                 length = codec::decodeFixed16(buf);
             }
-            // Padding of zeros behind the text keeps the lenient UTF-8 decoder
-            // inside the block whatever the bytes say.
-            const unsigned int pad = 8;
-            unsigned char local[kInlineTextBytes + 1 + 8];
-            unsigned char* bytes = local;
-            if (length > kInlineTextBytes) {
-                bytes = static_cast<unsigned char*>(kelm_malloc(length + 1 + pad));
-                if (bytes == nullptr) return false;
-            }
-            std::memset(bytes, 0, (length > kInlineTextBytes ? length : kInlineTextBytes) + 1 + pad);
-            bool ok = length == 0 || dataFile->read(bytes, length) == length;
-            if (ok) ok = storeText(static_cast<TextField*>(field), bytes, length);
-            if (bytes != local) kelm_free(bytes);
-            return ok;
+            PaddedText bytes;
+            if (!bytes.make(length)) return false;
+            if (length != 0 && dataFile->read(bytes.data(), length) != length) return false;
+            return storeText(static_cast<TextField*>(field), bytes.data(), length);
         }
         default:
             return false;  // type 6 is never stored, so it cannot be read back
