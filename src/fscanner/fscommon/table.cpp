@@ -723,6 +723,14 @@ bool FS_Table::peekedGuardedRead(unsigned int id, Fields& record) {
     if (!peekRecord(offset, schema, &end) || !peekPassesGuard(id, end)) return false;
     // Every check of the guarded read passed on these bytes: store them as
     // readRecord does.
+    // Out of memory for a text: the guarded read tries again.
+    if (!storePeeked(record, count)) return false;
+    // A refused row is left to the guarded read, which notes the damage.
+    if (guard->rowCheck != nullptr && guard->rowCheck(guard->rowCheckContext, record) != nullptr) return false;
+    return dataFile->seek(static_cast<long>(end), SEEK_FROM_START);
+}
+
+bool FS_Table::storePeeked(Fields& record, unsigned int count) {
     unsigned char bitmap[kBitmapBufferSize];
     unsigned int bits = bitmapSize <= kBitmapBufferSize ? bitmapSize : kBitmapBufferSize;
     std::memset(bitmap, 0, sizeof bitmap);
@@ -737,14 +745,11 @@ bool FS_Table::peekedGuardedRead(unsigned int id, Fields& record) {
             case FIELD_INT32: static_cast<Int32Field*>(field)->value(static_cast<unsigned int>(c.number)); break;
             case FIELD_INT64: static_cast<Int64Field*>(field)->value(c.number); break;
             default:
-                // Out of memory for the text: the guarded read tries again.
                 if (!storeText(static_cast<TextField*>(field), peekBytes.data() + c.at, c.length)) return false;
                 break;
         }
     }
-    // A refused row is left to the guarded read, which notes the damage.
-    if (guard->rowCheck != nullptr && guard->rowCheck(guard->rowCheckContext, record) != nullptr) return false;
-    return dataFile->seek(static_cast<long>(end), SEEK_FROM_START);
+    return true;
 }
 
 bool FS_Table::readRecord(unsigned int id, Fields& record) {
@@ -757,23 +762,7 @@ bool FS_Table::readRecord(unsigned int id, Fields& record) {
     // leaves the values read before the failure in the buffer.
     uint32_t end;
     if (record.count() != 0 && record.count() <= kMaxFields && peekRecord(offset, record, &end)) {
-        unsigned char bitmap[kBitmapBufferSize];
-        unsigned int bits = bitmapSize <= kBitmapBufferSize ? bitmapSize : kBitmapBufferSize;
-        std::memset(bitmap, 0, sizeof bitmap);
-        if (bits != 0) std::memcpy(bitmap, peekBytes.data(), bits);
-        bool ok = true;
-        for (unsigned int i = 0; i < record.count() && ok; ++i) {
-            Field* field = record.at(i);
-            field->setNull(checkBit(i, bitmap));
-            PeekedColumn const& c = peekColumns[i];
-            switch (field->getType()) {
-                case FIELD_INT8: static_cast<Int8Field*>(field)->value(static_cast<unsigned char>(c.number)); break;
-                case FIELD_INT16: static_cast<Int16Field*>(field)->value(static_cast<unsigned short>(c.number)); break;
-                case FIELD_INT32: static_cast<Int32Field*>(field)->value(static_cast<unsigned int>(c.number)); break;
-                case FIELD_INT64: static_cast<Int64Field*>(field)->value(c.number); break;
-                default: ok = storeText(static_cast<TextField*>(field), peekBytes.data() + c.at, c.length); break;
-            }
-        }
+        bool ok = storePeeked(record, record.count());
         // Where the field-by-field read would have left the file.
         if (ok) ok = dataFile->seek(static_cast<long>(end), SEEK_FROM_START);
         if (ok) return true;

@@ -297,6 +297,10 @@ private:
     // the end of the record, and per column where its bytes begin in
     // peekBytes and its value; false where readRecord would fail.
     bool peekRecord(uint32_t offset, Fields& layout, uint32_t* end);
+    // Stores the columns the last peekRecord found into the first count
+    // fields of record, as the field-by-field read would; false when a text
+    // finds no memory (the fields before it are stored).
+    bool storePeeked(Fields& record, unsigned int count);
     // Decodes length stored UTF-8 bytes into field as readValue does; false
     // when memory runs out.
     bool storeText(TextField* field, const unsigned char* bytes, uint32_t length);
