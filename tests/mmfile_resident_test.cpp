@@ -192,3 +192,51 @@ TEST(MmFileResident, AFileReadAtRandomKeepsItsWorkingSetInsteadOfFaultingItBack)
     EXPECT_LT(lastRoundFaults, static_cast<long long>(pages / 16));
     EXPECT_TRUE(f.close());
 }
+
+TEST(MmFileResident, APassDownwardsKeepsTheFirstBudgetAfterReadsAtRandom) {
+    // Reads at random raise the file's budget toward its largest; a pass in
+    // blocks from the end back to the start (an index checked whole) must
+    // still be held to the first budget, as a pass upwards is.
+    if (residentFileKib() < 0) GTEST_SKIP() << "no RssFile line in /proc/self/status";
+    const uint32_t bytes = 32u << 20;
+    TempDir dir;
+    std::string path = dir.file("downwards.bin");
+    {
+        LinuxMmFile f(path.c_str());
+        ASSERT_TRUE(f.create());
+        std::vector<unsigned char> piece(kPiece);
+        for (uint32_t at = 0; at < bytes; at += kPiece) {
+            for (uint32_t k = 0; k < kPiece; ++k) piece[k] = patternAt(at + k);
+            ASSERT_EQ(kPiece, f.write(piece.data(), kPiece));
+        }
+        ASSERT_TRUE(f.close());
+    }
+    LinuxMmFile f(path.c_str());
+    ASSERT_TRUE(f.open());
+    long long before = residentFileKib();
+    // Reads at random over the first 12 MiB, as the growth test does.
+    uint32_t seed = 777;
+    for (int round = 0; round < 6; ++round) {
+        for (uint32_t i = 0; i < (12u << 20) / 4096; ++i) {
+            seed = seed * 1103515245u + 12345u;
+            uint32_t at = (seed >> 4) % ((12u << 20) - 8);
+            unsigned char value[8];
+            ASSERT_TRUE(f.seek(static_cast<long>(at), SEEK_FROM_START));
+            ASSERT_EQ(8u, f.read(value, 8));
+            ASSERT_EQ(patternAt(at), value[0]) << "at " << at;
+        }
+    }
+    long long most = 0;
+    std::vector<unsigned char> piece(kPiece);
+    for (uint32_t end = bytes; end > 0; end -= kPiece) {
+        uint32_t at = end - kPiece;
+        ASSERT_TRUE(f.seek(static_cast<long>(at), SEEK_FROM_START));
+        ASSERT_EQ(kPiece, f.read(piece.data(), kPiece)) << "at " << at;
+        for (uint32_t k = 0; k < kPiece; k += 4096) ASSERT_EQ(patternAt(at + k), piece[k]) << "at " << at + k;
+        // Past the first few MiB of the pass (what the reads at random
+        // left resident is dropped by then), the pass holds what it reads.
+        if (bytes - at >= (4u << 20) && at % (1u << 20) == 0) most = std::max(most, residentFileKib() - before);
+    }
+    EXPECT_LT(most, kResidentLimitKib);
+    EXPECT_TRUE(f.close());
+}

@@ -336,3 +336,112 @@ TEST_F(TableLazyGuardTest, RowCheckRefusalIsTheDamageOfTheDataFile) {
     EXPECT_EQ(wpath("files.dat"), std::wstring(t->damagedFile()));
     EXPECT_GE(calls, 2);
 }
+
+TEST_F(TableLazyGuardTest, AWalkChecksEachIndexWholeAtItsFirstRow) {
+    // The chain of "same.txt" cut behind its bucket: records 6, 4, 2 and 0
+    // are in no chain any more.  Record 1 ("name1") is filed soundly.
+    std::vector<uint32_t> chain = chainOf("files_FILENAME.idx", L"SAME.TXT");
+    ASSERT_EQ(5u, chain.size());
+    std::string end(4, '\0');
+    putWord(&end, 0, Index::EMPTY);
+    patch("files_FILENAME.idx", static_cast<size_t>(chain[0]) * 8 + 4, end);
+
+    // Read by number, record 1 finds its own chain whole.
+    ASSERT_TRUE(reopen());
+    std::wstring name;
+    EXPECT_TRUE(readName(1, &name));
+    EXPECT_FALSE(t->isDamaged());
+
+    // Read in a walk over every row, it brings the whole index in.
+    ASSERT_TRUE(reopen());
+    unsigned int id = 0;
+    ASSERT_TRUE(t->moveFirst(id));
+    ASSERT_TRUE(t->moveNext(id));
+    ASSERT_EQ(1u, id);
+    EXPECT_FALSE(readName(1, &name));
+    ASSERT_TRUE(t->isDamaged());
+    EXPECT_STREQ("overflow slot outside every chain", t->damagedCheck());
+    EXPECT_EQ(wpath("files_FILENAME.idx"), std::wstring(t->damagedFile()));
+}
+
+// The whole check of an index has two forms that must agree on every index:
+// the walk along the chains that names the damage, and the pass in file
+// order that only says whether there is any.  Indexes built as inserts
+// build them, with one word changed or not, are given to both.
+TEST(IndexWholeCheck, PassInFileOrderAgreesWithTheChainWalk) {
+    const uint32_t kEmpty = Index::EMPTY;  // a copy: vectors bind it by reference
+    uint32_t seed = 20261125;
+    auto random = [&seed](uint32_t below) {
+        seed = seed * 1103515245u + 12345u;
+        return below == 0 ? 0 : (seed >> 8) % below;
+    };
+    int sound = 0, damaged = 0;
+    for (int trial = 0; trial < 600; ++trial) {
+        uint32_t records = 1 + random(300);
+        std::vector<uint32_t> words(static_cast<size_t>(Index::BUCKETS) * 2, kEmpty);
+        // Few buckets, so that chains grow long; bucket 65535 as well, the
+        // last bucket slot.
+        uint32_t spread = 1 + random(6);
+        for (uint32_t id = 0; id < records; ++id) {
+            uint32_t bucket = random(8) == 0 ? Index::BUCKETS - 1 : random(spread);
+            size_t head = static_cast<size_t>(bucket) * 2;
+            if (words[head] != kEmpty) {
+                uint32_t slot = static_cast<uint32_t>(words.size() / 2);
+                words.push_back(words[head]);
+                words.push_back(words[head + 1]);
+                words[head + 1] = slot;
+            }
+            words[head] = id;
+        }
+        uint32_t total = static_cast<uint32_t>(words.size() / 2);
+        uint32_t checkedRecords = records;
+        switch (random(6)) {
+            case 0:
+                break;  // sound
+            case 1: {   // a word of a used slot changed
+                std::vector<uint32_t> used;
+                for (uint32_t s = 0; s < total; ++s)
+                    if (words[static_cast<size_t>(s) * 2] != kEmpty) used.push_back(s);
+                size_t at = static_cast<size_t>(used[random(static_cast<uint32_t>(used.size()))]) * 2 + random(2);
+                uint32_t values[] = {kEmpty, random(records + 2), random(total + 2), Index::BUCKETS + random(8),
+                                     random(Index::BUCKETS), 0};
+                words[at] = values[random(6)];
+                break;
+            }
+            case 2:  // an empty bucket given a chain
+                words[static_cast<size_t>(Index::BUCKETS - 2) * 2 + 1] = Index::BUCKETS + random(total - Index::BUCKETS + 1);
+                break;
+            case 3:  // an overflow slot that no chain reaches
+                words.push_back(random(records));
+                words.push_back(kEmpty);
+                ++total;
+                break;
+            case 4:  // one record more or less than the index holds
+                checkedRecords = random(2) == 0 ? records + 1 : records - 1;
+                break;
+            default: {  // two words swapped
+                size_t a = random(total) * 2u + random(2), b = random(total) * 2u + random(2);
+                std::swap(words[a], words[b]);
+                break;
+            }
+        }
+        auto readSlots = [&words](uint32_t first, uint32_t count, uint32_t* out) {
+            if (static_cast<size_t>(first + count) * 2 > words.size()) return false;
+            std::memcpy(out, words.data() + static_cast<size_t>(first) * 2, static_cast<size_t>(count) * 8);
+            return true;
+        };
+        std::vector<uint32_t> byPass, byChains;
+        bool passSound = indexChainsSound(readSlots, total, checkedRecords, byPass);
+        char const* damage = indexChainsDamage(words, total, checkedRecords, byChains);
+        ASSERT_EQ(damage == nullptr, passSound) << "trial " << trial << ": " << (damage ? damage : "sound");
+        if (passSound) {
+            EXPECT_EQ(byChains, byPass) << "trial " << trial;
+            ++sound;
+        } else {
+            ++damaged;
+        }
+    }
+    // Both answers were given often.
+    EXPECT_GT(sound, 100);
+    EXPECT_GT(damaged, 200);
+}

@@ -205,7 +205,7 @@ bool StdFile::size(unsigned int* result) {
 
 LinuxMmFile::LinuxMmFile(char const* fileName)
     : fd(-1), logical(0), allocated(0), position(0), address(kUnmapped), eofFlag(0), name(nullptr),
-      written(false), touchedPages(0), lastPage(~0u), passPages(0), readPages(0), refaultedPages(0),
+      written(false), touchedPages(0), lastPage(~0u), lastFirstPage(~0u), passPages(0), readPages(0), refaultedPages(0),
       budgetPages(0), mappedLength(0) {
     if (fileName != nullptr) name = i_strdup(fileName);
 }
@@ -440,9 +440,14 @@ void LinuxMmFile::touched(uint32_t from, unsigned int length, bool reading) {
     // it, make a pass; any other jump ends it.
     if (lastPage != ~0u && first >= lastPage && first <= lastPage + kFaultAroundPages)
         passPages += last - lastPage;
+    else if (lastPage != ~0u && last < lastFirstPage && last + kFaultAroundPages >= lastFirstPage)
+        // The same downwards: blocks read from the end of a file back to
+        // its start (an index's overflow slots, checked whole).
+        passPages += lastFirstPage - first;
     else
         passPages = 0;
     lastPage = last;
+    lastFirstPage = first;
     const uint64_t pages = static_cast<uint64_t>(touchedMap.size()) * 64;
     for (uint32_t page = first; page <= last && page < pages; ++page) {
         if (reading) noteRead(page);

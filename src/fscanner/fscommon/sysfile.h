@@ -230,12 +230,15 @@ private:
     // One bit per page of the mapping, set when an access may have made it
     // resident since the mapping was made or last dropped (an upper bound);
     // touchedPages counts the set bits.  lastPage is the page of the last
-    // access: most accesses stay in it and need no look at the bits.
+    // access (where it ended; lastFirstPage where it began): most accesses
+    // stay in it and need no look at the bits.
     std::vector<uint64_t> touchedMap;
     uint32_t touchedPages;
     uint32_t lastPage;
+    uint32_t lastFirstPage;
     // Pages the current pass has moved over (accesses each starting where
-    // the last ended or just behind it); 0 after any other jump.
+    // the last ended or just behind it, or each ending just below where the
+    // last began); 0 after any other jump.
     uint32_t passPages;
     // Pages read since the last drop (readPages of them), pages read and
     // then dropped at some earlier drop of this mapping, how many of the

@@ -20,10 +20,10 @@
 // links of every chain a lookup follows, and for every index that its key's
 // chain holds the record (met under that bucket by the lookup, or found by
 // walking the chain).  A walk over the whole pointer file tests the rising
-// offsets and the stored count on its way.  Chain searches that add up to a
-// share of an index's size check that index whole once (verifyIndex) and
-// answer from its map after, so a query that reads every row pays for each
-// index once.  verifyWhole() does all of it at once.
+// offsets and the stored count on its way, and checks each index whole
+// (verifyIndex) at its first key check, then answers from the index's map;
+// outside a walk, chain searches that add up to a share of an index's size
+// do the same.  So a query that reads every row pays for each index once.  verifyWhole() does all of it at once.
 //
 // A crash breaks some of these (padding, a count behind its slot): a table
 // left by a crash is never verified, since the cache refuses it by its
@@ -271,11 +271,24 @@ bool FS_Table::verifyIndex(TableGuard::IndexBuckets& entry, uint32_t slots) {
     unsigned int total = 0;
     if (!index.slotCount(&total)) return noteDamage(path, "index file size is not whole slots");
     if (total < Index::BUCKETS) return noteDamage(path, "index file is shorter than its buckets");
-    std::vector<uint32_t> words(static_cast<size_t>(total) * 2);
-    if (!index.readSlots(0, total, words.data())) return noteDamage(path, "index file cannot be read");
+    auto readSlots = [&index](uint32_t first, uint32_t count, uint32_t* words) {
+        return index.readSlots(first, count, words);
+    };
+    if (!indexChainsSound(readSlots, total, slots, entry.bucketOf)) {
+        // Damaged (or unreadable): walk the chains as a lookup would, to
+        // name the damage a lookup meets first.
+        std::vector<uint32_t> words(static_cast<size_t>(total) * 2);
+        if (!index.readSlots(0, total, words.data())) return noteDamage(path, "index file cannot be read");
+        char const* damage = indexChainsDamage(words, total, slots, entry.bucketOf);
+        if (damage != nullptr) return noteDamage(path, damage);
+    }
+    entry.whole = true;
+    return true;
+}
 
-    std::vector<uint32_t>& bucketOf = entry.bucketOf;
-    bucketOf.assign(slots, TableGuard::UNKNOWN_BUCKET);
+char const* indexChainsDamage(const std::vector<uint32_t>& words, uint32_t total, uint32_t records,
+                              std::vector<uint32_t>& bucketOf) {
+    bucketOf.assign(records, TableGuard::UNKNOWN_BUCKET);
     std::vector<bool> reached(total - Index::BUCKETS, false);
     uint32_t entries = 0;
     uint32_t overflowReached = 0;
@@ -285,21 +298,21 @@ bool FS_Table::verifyIndex(TableGuard::IndexBuckets& entry, uint32_t slots) {
         uint32_t next = words[static_cast<size_t>(slot) * 2 + 1];
         if (id == Index::EMPTY) {
             // A bucket is only ever chained behind a first entry.
-            if (next != Index::EMPTY) return noteDamage(path, "empty bucket has a chain");
+            if (next != Index::EMPTY) return "empty bucket has a chain";
             continue;
         }
         for (;;) {
-            if (id == Index::EMPTY) return noteDamage(path, "empty slot inside a chain");
-            if (id >= slots) return noteDamage(path, "index entry names a record past the pointer file");
-            if (bucketOf[id] != TableGuard::UNKNOWN_BUCKET) return noteDamage(path, "record filed twice in the index");
+            if (id == Index::EMPTY) return "empty slot inside a chain";
+            if (id >= records) return "index entry names a record past the pointer file";
+            if (bucketOf[id] != TableGuard::UNKNOWN_BUCKET) return "record filed twice in the index";
             bucketOf[id] = bucket;
             ++entries;
             if (next == Index::EMPTY) break;
             // Overflow slots are appended and linked to older ones, so along
             // a chain their numbers fall; a link that does not is damage.
             if (next < Index::BUCKETS || next >= total || (slot >= Index::BUCKETS && next >= slot))
-                return noteDamage(path, "chain link points outside the overflow slots");
-            if (reached[next - Index::BUCKETS]) return noteDamage(path, "overflow slot is in two chains");
+                return "chain link points outside the overflow slots";
+            if (reached[next - Index::BUCKETS]) return "overflow slot is in two chains";
             reached[next - Index::BUCKETS] = true;
             ++overflowReached;
             slot = next;
@@ -307,10 +320,63 @@ bool FS_Table::verifyIndex(TableGuard::IndexBuckets& entry, uint32_t slots) {
             next = words[static_cast<size_t>(slot) * 2 + 1];
         }
     }
-    if (overflowReached != total - Index::BUCKETS) return noteDamage(path, "overflow slot outside every chain");
-    if (entries != slots) return noteDamage(path, "index does not hold every record number");
-    entry.whole = true;
-    return true;
+    if (overflowReached != total - Index::BUCKETS) return "overflow slot outside every chain";
+    if (entries != records) return "index does not hold every record number";
+    return nullptr;
+}
+
+bool indexChainsSound(const std::function<bool(uint32_t, uint32_t, uint32_t*)>& readSlots, uint32_t total,
+                      uint32_t records, std::vector<uint32_t>& bucketOf) {
+    if (total < Index::BUCKETS) return false;
+    bucketOf.assign(records, TableGuard::UNKNOWN_BUCKET);
+    // The bucket of each overflow slot's chain, set by the one slot that
+    // links to it: buckets number 65536, so 16 bits hold one.
+    static_assert(Index::BUCKETS <= 65536, "a bucket number fits 16 bits");
+    const uint32_t overflow = total - Index::BUCKETS;
+    std::vector<uint16_t> chainOf(overflow);
+    std::vector<bool> linked(overflow, false);
+    uint32_t entries = 0;
+    // One slot of a chain whose bucket is known: its record and its link.
+    auto visit = [&](uint32_t slot, uint32_t bucket, uint32_t id, uint32_t next) {
+        if (id == Index::EMPTY || id >= records || bucketOf[id] != TableGuard::UNKNOWN_BUCKET) return false;
+        bucketOf[id] = bucket;
+        ++entries;
+        if (next == Index::EMPTY) return true;
+        if (next < Index::BUCKETS || next >= total || (slot >= Index::BUCKETS && next >= slot)) return false;
+        uint32_t o = next - Index::BUCKETS;
+        if (linked[o]) return false;
+        linked[o] = true;
+        chainOf[o] = static_cast<uint16_t>(bucket);
+        return true;
+    };
+    const uint32_t block = 8192;  // slots per read
+    std::vector<uint32_t> words(static_cast<size_t>(block) * 2);
+    for (uint32_t first = 0; first < Index::BUCKETS; first += block) {
+        uint32_t n = Index::BUCKETS - first < block ? Index::BUCKETS - first : block;
+        if (!readSlots(first, n, words.data())) return false;
+        for (uint32_t i = 0; i < n; ++i) {
+            uint32_t id = words[static_cast<size_t>(i) * 2], next = words[static_cast<size_t>(i) * 2 + 1];
+            if (id == Index::EMPTY) {
+                if (next != Index::EMPTY) return false;
+                continue;
+            }
+            if (!visit(first + i, first + i, id, next)) return false;
+        }
+    }
+    for (uint32_t end = total; end > Index::BUCKETS;) {
+        uint32_t n = end - Index::BUCKETS < block ? end - Index::BUCKETS : block;
+        uint32_t first = end - n;
+        if (!readSlots(first, n, words.data())) return false;
+        for (uint32_t i = n; i-- > 0;) {
+            uint32_t slot = first + i, o = slot - Index::BUCKETS;
+            // Every slot that links here stands higher, or is a bucket.
+            if (!linked[o]) return false;
+            if (!visit(slot, chainOf[o], words[static_cast<size_t>(i) * 2], words[static_cast<size_t>(i) * 2 + 1]))
+                return false;
+        }
+        end = first;
+    }
+    return entries == records;
 }
 
 bool FS_Table::guardSlot(unsigned int id, uint32_t offset) {
@@ -403,7 +469,10 @@ bool FS_Table::guardFiled(TableGuard::IndexBuckets& entry, unsigned int id, uint
     Index& index = *entry.index;
     if (guard->reachedIndex == &index && guard->reachedId == id)
         return bucket == guard->reachedBucket || noteDamage(index.getIndexFullPathName(), misfiled);
-    if (!entry.whole && entry.searched > searchBudget(entry.slots) &&
+    // A walk over the pointer file checks the keys of every row it reads:
+    // the whole index, read once in order, costs less than the chains of a
+    // few rows, each link a jump to another page of the file.
+    if (!entry.whole && (guard->walking || entry.searched > searchBudget(entry.slots)) &&
         !verifyIndex(entry, contentSize(pointerFile) / kSlotSize))
         return false;
     if (entry.whole) {

@@ -7,6 +7,7 @@
 #define FSCANNER_FSCOMMON_TABLE_VERIFY_H
 
 #include <cstdint>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -86,5 +87,24 @@ struct TableGuard {
     char const* (*rowCheck)(void* context, Fields& record) = nullptr;
     void* rowCheckContext = nullptr;
 };
+
+// The whole check of one hash index of total slots (Index::BUCKETS bucket
+// slots, then overflow slots; two words per slot: record number, next
+// slot) against a table of records record numbers.  Both fill bucketOf
+// with the bucket each record number is filed under when the index is
+// sound, and accept exactly the same indexes.
+//
+// indexChainsDamage walks the chains bucket by bucket, as a lookup does,
+// and names the first damage it meets (nullptr when sound); it needs every
+// slot in words.  indexChainsSound says only whether the index is sound,
+// reading it through readSlots (first slot, count, words) in blocks: the
+// buckets first, then the overflow slots from the last down.  A link only
+// ever leads to a lower overflow slot, so every slot's bucket is known
+// before the pass reaches it, and the pass touches memory in order instead
+// of jumping along chains, which on a large index is a cache miss a slot.
+char const* indexChainsDamage(const std::vector<uint32_t>& words, uint32_t total, uint32_t records,
+                              std::vector<uint32_t>& bucketOf);
+bool indexChainsSound(const std::function<bool(uint32_t, uint32_t, uint32_t*)>& readSlots, uint32_t total,
+                      uint32_t records, std::vector<uint32_t>& bucketOf);
 
 #endif
