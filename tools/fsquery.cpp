@@ -169,7 +169,13 @@ void appendLocal(std::string& out, const wchar_t* text) {
     std::mbstate_t state = std::mbstate_t();
     for (; *text != L'\0'; ++text) {
         if (static_cast<unsigned int>(*text) < 0x80) {
-            out.push_back(static_cast<char>(*text));
+            // A run of ASCII, the whole of most paths, goes in at once.
+            const wchar_t* end = text + 1;
+            while (*end != L'\0' && static_cast<unsigned int>(*end) < 0x80) ++end;
+            size_t at = out.size();
+            out.resize(at + static_cast<size_t>(end - text));
+            for (char* to = &out[at]; text != end; ++text) *to++ = static_cast<char>(*text);
+            --text;
             continue;
         }
         size_t n = std::wcrtomb(buffer, *text, &state);
