@@ -235,3 +235,20 @@ TEST_F(SkippedEntries, StatsShowTheCountsAndTheDirectWalksRealDirectoryCount) {
         EXPECT_TRUE(contains(r.err, "fsquery: hits: 2\n")) << r.err;
     }
 }
+
+TEST_F(SkippedEntries, NamesValidInTheLocalePrintAsTheyAreOnDisk) {
+    // Names that mix ASCII runs with multibyte characters, in a directory so
+    // named: printed byte for byte, from the cache and from the walk.
+    dir.write("tree/caf\xc3\xa9/r\xc3\xa9sum\xc3\xa9-v2.txt", "r\n");
+    dir.write("tree/caf\xc3\xa9/\xe2\x82\xac\xe2\x82\xac.c", "e\n");
+    std::set<std::string> expected = {tree + "/a.c", tree + "/sub/b.c",
+                                      tree + "/caf\xc3\xa9/r\xc3\xa9sum\xc3\xa9-v2.txt",
+                                      tree + "/caf\xc3\xa9/\xe2\x82\xac\xe2\x82\xac.c"};
+    for (bool direct : {false, true}) {
+        std::vector<std::string> args = {tree};
+        if (direct) args.insert(args.begin(), "--no-cache");
+        ToolRun r = run(args);
+        EXPECT_EQ(0, r.status) << r.err;
+        EXPECT_EQ(expected, r.lineSet()) << (direct ? "direct walk" : "cache");
+    }
+}
