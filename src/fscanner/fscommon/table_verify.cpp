@@ -109,11 +109,12 @@ bool Index::readSlots(unsigned int first, unsigned int count, uint32_t* words) {
     if (file == nullptr) return false;
     if (!file->seek(static_cast<long>(static_cast<unsigned long long>(first) * 8), SEEK_FROM_START)) return false;
     const unsigned int block = 8192;  // slots per read
-    std::vector<char> raw(static_cast<size_t>(block) * 8);
     for (unsigned int done = 0; done < count;) {
         unsigned int n = count - done < block ? count - done : block;
-        if (file->read(raw.data(), n * 8) != n * 8) return false;
-        for (unsigned int i = 0; i < n * 2; ++i) words[static_cast<size_t>(done) * 2 + i] = codec::decodeFixed32(raw.data() + i * 4);
+        // Read straight into words and decode each word where it lies.
+        uint32_t* at = words + static_cast<size_t>(done) * 2;
+        if (file->read(at, n * 8) != n * 8) return false;
+        for (unsigned int i = 0; i < n * 2; ++i) at[i] = codec::decodeFixed32(reinterpret_cast<const char*>(at + i));
         done += n;
     }
     return true;
@@ -334,7 +335,7 @@ bool indexChainsSound(const std::function<bool(uint32_t, uint32_t, uint32_t*)>& 
     static_assert(Index::BUCKETS <= 65536, "a bucket number fits 16 bits");
     const uint32_t overflow = total - Index::BUCKETS;
     std::vector<uint16_t> chainOf(overflow);
-    std::vector<bool> linked(overflow, false);
+    std::vector<uint8_t> linked(overflow, 0);
     uint32_t entries = 0;
     // One slot of a chain whose bucket is known: its record and its link.
     auto visit = [&](uint32_t slot, uint32_t bucket, uint32_t id, uint32_t next) {
@@ -344,8 +345,8 @@ bool indexChainsSound(const std::function<bool(uint32_t, uint32_t, uint32_t*)>& 
         if (next == Index::EMPTY) return true;
         if (next < Index::BUCKETS || next >= total || (slot >= Index::BUCKETS && next >= slot)) return false;
         uint32_t o = next - Index::BUCKETS;
-        if (linked[o]) return false;
-        linked[o] = true;
+        if (linked[o] != 0) return false;
+        linked[o] = 1;
         chainOf[o] = static_cast<uint16_t>(bucket);
         return true;
     };
@@ -370,7 +371,7 @@ bool indexChainsSound(const std::function<bool(uint32_t, uint32_t, uint32_t*)>& 
         for (uint32_t i = n; i-- > 0;) {
             uint32_t slot = first + i, o = slot - Index::BUCKETS;
             // Every slot that links here stands higher, or is a bucket.
-            if (!linked[o]) return false;
+            if (linked[o] == 0) return false;
             if (!visit(slot, chainOf[o], words[static_cast<size_t>(i) * 2], words[static_cast<size_t>(i) * 2 + 1]))
                 return false;
         }
