@@ -537,3 +537,80 @@ TEST_F(RecordSetTest, PointerSlotPastTheEndOfTheDataFileEndsTheLookup) {
 }
 
 }  // namespace
+
+// The cache's lookups of the form "[column]==variable" on two INT32s are
+// decided by the cursor (compareInt32) instead of the evaluator: on a walk
+// and on a hash chain, for values in one bucket, at the ends of the range,
+// absent, and with a null on either side, the records are the same.
+TEST_F(RecordSetTest, Int32ComparisonDecidesEveryRecordAsTheEvaluatorDoes) {
+    int bucket = hash(L"7", Index::BUCKETS);
+    unsigned int other = 0;
+    wchar_t text[16];
+    for (unsigned int v = 8; v < 10000000u && other == 0; ++v)
+        if (hash(wcs_itoa(v, text), Index::BUCKETS) == bucket) other = v;
+    ASSERT_NE(0u, other);
+    RecordSet rs = t->openRecordSet();
+    add(rs, 7, L"a");
+    add(rs, other, L"b");
+    add(rs, 7, L"c");
+    add(rs, 0, L"d");
+    add(rs, 0xFFFFFFFFu, L"e");
+    add(rs, 0x80000000u, L"f");
+    rs.setFieldAsString(L"S", L"null");
+    rs.get()->getRecord()->name(L"N")->setNull(true);
+    ASSERT_TRUE(rs.insert());
+    ASSERT_TRUE(t->addHashIndex(L"byN", L"N"));
+
+    Fields variables;
+    ASSERT_TRUE(variables.add(L"id", FIELD_INT32));
+    Int32Field* id = static_cast<Int32Field*>(variables.name(L"id"));
+    CriteriaEvaluator walk(L"[N]==id");
+    CriteriaEvaluator chain(L"[N]==id");
+    ASSERT_TRUE(walk.setVariables(&variables));
+    ASSERT_TRUE(chain.setVariables(&variables));
+    auto names = [&](CriteriaEvaluator& e, bool byIndex, bool compared) {
+        if (byIndex) {
+            // As the cache names the column and the value of a lookup.
+            ExpValue key;
+            key.setNValueString(L"N");
+            key.setNumericValue(id->value());
+            EXPECT_TRUE(e.setHashInfo(key));
+        }
+        EXPECT_TRUE(rs.setCriteria(&e, false));
+        EXPECT_EQ(byIndex, rs.get()->isIndexNavigation());
+        if (compared) EXPECT_TRUE(rs.get()->compareInt32(0, id));
+        std::wstring seen;
+        for (bool ok = rs.moveFirst(); ok; ok = rs.moveNext()) seen += std::wstring(rs.getFieldAsString(L"S")) + L",";
+        return seen;
+    };
+    int found = 0;
+    for (unsigned int v : {7u, other, 0u, 0xFFFFFFFFu, 0x80000000u, 12345u}) {
+        for (bool nullVariable : {false, true}) {
+            id->value(v);
+            id->setNull(nullVariable);
+            std::wstring byEvaluator = names(walk, false, false);
+            EXPECT_EQ(byEvaluator, names(walk, false, true)) << v << (nullVariable ? " null" : "");
+            if (!nullVariable) {
+                std::wstring onChain = names(chain, true, false);
+                EXPECT_EQ(onChain, names(chain, true, true)) << v;
+                found += onChain.empty() ? 0 : 1;
+            }
+        }
+    }
+    EXPECT_EQ(5, found);
+    id->setNull(false);
+    id->value(7);
+    EXPECT_EQ(L"c,a,", names(chain, true, true));  // the chain holds the newest first
+
+    // Only an INT32 column against an INT32 variable, and only under criteria.
+    ASSERT_TRUE(rs.setCriteria(&walk, false));
+    EXPECT_FALSE(rs.get()->compareInt32(1, id));
+    EXPECT_FALSE(rs.get()->compareInt32(2, id));
+    EXPECT_FALSE(rs.get()->compareInt32(3, id));
+    EXPECT_FALSE(rs.get()->compareInt32(0, nullptr));
+    Fields texts;
+    ASSERT_TRUE(texts.add(L"name", FIELD_TEXT));
+    EXPECT_FALSE(rs.get()->compareInt32(0, texts.at(0)));
+    ASSERT_TRUE(rs.setCriteria(nullptr, false));
+    EXPECT_FALSE(rs.get()->compareInt32(0, id));
+}

@@ -43,6 +43,9 @@ wchar_t const* const criteriaTexts[7] = {
     L"[PATHNAME]==pathname",
     L"[PATHID]==pathid && ([FILENAME]==filename || [SHORTFILENAME]==shortfilename)",
     L"[PATHID]==pathid && [FILENAME]==filename"};
+// The criteria above that are exactly "[column]==variable" on two INT32s.
+Int32Equality const int32Equalities[3] = {
+    {CRIT_PATH_ID, L"PATHID", VAR_PATHID}, {CRIT_PARENT_ID, L"PARENTID", VAR_PARENTID}, {CRIT_ID, L"ID", VAR_ID}};
 }  // namespace cachetables
 
 namespace {
@@ -253,6 +256,15 @@ bool FS_CacheBase::lookUp(RecordSet& set, int criterion, wchar_t const* column, 
     }
     evaluator->setHashInfo(hashValue);
     set.setCriteria(evaluator, caseSensitive);
+    // The criteria that compare one INT32 column with one INT32 variable are
+    // decided by the cursor itself, without the evaluator, for each
+    // candidate of the hash chain (a directory's path is rebuilt through
+    // these, one lookup per component).
+    for (cachetables::Int32Equality const& e : cachetables::int32Equalities) {
+        if (e.criterion != criterion) continue;
+        int at = set.get()->getRecord()->indexOf(e.column);
+        if (at >= 0) set.get()->compareInt32(static_cast<unsigned int>(at), variableHandles[e.variable]);
+    }
     return set.moveFirst();
 }
 

@@ -45,6 +45,14 @@ enum Criterion { CRIT_PATH_ID, CRIT_PARENT_ID, CRIT_ID, CRIT_PATH_OR_SHORT_PATH,
                  CRIT_FILE_OR_SHORT_FILE, CRIT_FILE_NAME };
 enum Variable { VAR_ID, VAR_PATHID, VAR_PARENTID, VAR_PATHNAME, VAR_SHORTPATHNAME, VAR_FILENAME,
                 VAR_SHORTFILENAME, VAR_MD5, VAR_CRC32, VAR_Q32 };
+// A prepared criterion that is one comparison of an INT32 column with an
+// INT32 variable, which the cursor decides without the evaluator.
+struct Int32Equality {
+    Criterion criterion;
+    wchar_t const* column;
+    Variable variable;
+};
+extern Int32Equality const int32Equalities[3];
 // Longest path, in wide characters, that the lookups rebuild.
 const unsigned int PATH_CHARS = 4096;
 // Longest memo text in bytes, terminator included; a longer name is cut.

@@ -42,7 +42,9 @@ __recordSet::__recordSet()
       caseFlag(false),
       hasCriteria(false),
       evaluator(nullptr),
-      nameFilter(nullptr) {}
+      nameFilter(nullptr),
+      equalColumn(-1),
+      equalVariable(nullptr) {}
 
 __recordSet::__recordSet(FS_Table* owner)
     : id(0),
@@ -56,7 +58,9 @@ __recordSet::__recordSet(FS_Table* owner)
       caseFlag(false),
       hasCriteria(false),
       evaluator(nullptr),
-      nameFilter(nullptr) {}
+      nameFilter(nullptr),
+      equalColumn(-1),
+      equalVariable(nullptr) {}
 
 __recordSet::~__recordSet() {
     kelm_free(key);
@@ -74,6 +78,8 @@ void __recordSet::forgetIndex() {
 bool __recordSet::setCriteria(CriteriaEvaluator* criteria, bool caseSensitive) {
     forgetIndex();
     nameFilter = nullptr;
+    equalColumn = -1;
+    equalVariable = nullptr;
     evaluator = criteria;
     if (criteria == nullptr || criteria->getCriteria() == nullptr || criteria->getCriteria()[0] == L'\0') {
         hasCriteria = false;
@@ -108,7 +114,28 @@ bool __recordSet::setCriteria(CriteriaEvaluator* criteria, bool caseSensitive) {
 // A record fits when no criteria are set or the evaluator accepts it.  The
 // evaluator has the last word on every candidate, also on those of a hash
 // chain, which holds collisions and stale entries.
-bool __recordSet::fits() { return !hasCriteria || evaluator->check(record, nullptr, caseFlag) > 0; }
+//
+// Criteria that are one comparison of an INT32 column with an INT32
+// variable (compareInt32) are decided here: the evaluator turns both sides
+// into numbers the same way, so they are equal exactly when the two 32-bit
+// values are.  A null side goes to the evaluator.
+bool __recordSet::fits() {
+    if (!hasCriteria) return true;
+    if (equalColumn >= 0) {
+        Field* field = record->at(static_cast<unsigned int>(equalColumn));
+        if (!field->isNull() && !equalVariable->isNull())
+            return static_cast<Int32Field*>(field)->value() == static_cast<Int32Field*>(equalVariable)->value();
+    }
+    return evaluator->check(record, nullptr, caseFlag) > 0;
+}
+
+bool __recordSet::compareInt32(unsigned int column, Field* variable) {
+    if (!hasCriteria || record == nullptr || column >= record->count() || variable == nullptr) return false;
+    if (record->at(column)->getType() != FIELD_INT32 || variable->getType() != FIELD_INT32) return false;
+    equalColumn = static_cast<int>(column);
+    equalVariable = variable;
+    return true;
+}
 
 bool __recordSet::readAndDecide(bool* accepted) {
     if (nameFilter != nullptr) {

@@ -97,6 +97,13 @@ public:
     unsigned int getPosition() const { return position; }
     Fields* getRecord() const { return record; }
     bool isIndexNavigation() const { return index != nullptr && key != nullptr; }
+    // For criteria set by the last setCriteria that are exactly one
+    // comparison "[column]==variable" of an INT32 column of the record with
+    // an INT32 variable: the cursor decides each record by comparing the two
+    // values instead of running the evaluator, which decides them the same
+    // way.  Until the next setCriteria.  False, and nothing changes, without
+    // criteria or when a type is not INT32.
+    bool compareInt32(unsigned int column, Field* variable);
 
 private:
     __recordSet(const __recordSet&) = delete;
@@ -123,6 +130,10 @@ private:
     // The evaluator's byte test of the stored names, for walks over the
     // whole table; null when it has none.  Owned by the evaluator.
     NameMaskFilter const* nameFilter;
+    // Set by compareInt32: the column (-1 for none) and the variable it is
+    // compared with.  The variable is not owned.
+    int equalColumn;
+    Field* equalVariable;
 };
 
 class RecordSet {

@@ -320,7 +320,11 @@ unsigned int LinuxMmFile::read(void* buffer, unsigned int length) {
     }
     if (copied != 0) {
         std::memcpy(buffer, address + position, copied);
-        touched(position, copied, true);
+        // Most reads stay inside the page of the last access, which has
+        // nothing new to count.
+        const unsigned int shift = pageShift();
+        if ((position >> shift) != lastPage || ((static_cast<uint64_t>(position) + copied - 1) >> shift) != lastPage)
+            touched(position, copied, true);
     }
     position += copied;
     return copied;
