@@ -2,11 +2,13 @@
 
 #include <gtest/gtest.h>
 
+#include <clocale>
 #include <cstring>
 #include <memory>
 #include <string>
 #include <vector>
 
+#include "fscanner/fscommon/stringhelper.h"
 #include "fscanner/fscommon/sync.h"
 #include "support/testsupport.h"
 
@@ -892,3 +894,39 @@ TEST_F(TableTest, IntegerKeysAreTheirDecimalText) {
 }
 
 }  // namespace
+
+// A text key is filed under hash() of the text as wcsupper upper-cases it:
+// ASCII, letters the locale upper-cases, letters it does not, characters
+// outside the basic plane, and a name longer than 255 characters.
+TEST_F(TableTest, TextKeysAreFiledUnderTheBucketOfTheirUpperCase) {
+    std::string saved = std::setlocale(LC_CTYPE, nullptr);
+    bool utf8 = std::setlocale(LC_CTYPE, "C.UTF-8") != nullptr;
+    std::vector<std::wstring> names = {L"plain.txt", L"MiXeD.C", L"caf\u00e9.txt", L"stra\u00dfe", L"\u0131d\u0130",
+                                       L"\u00ff\u0178", L"x\U0001F600y", L"", std::wstring(300, L'a') + L"\u00e9"};
+    {
+        auto t = table(L"keys");
+        t->addField(L"name", FIELD_TEXT);
+        ASSERT_TRUE(t->create());
+        ASSERT_TRUE(t->addHashIndex(L"keys_name", L"name"));
+        Fields rec(t->getFields());
+        for (const std::wstring& name : names) {
+            setText(rec, 0, name.c_str());
+            ASSERT_TRUE(t->insert(rec));
+        }
+        Index* index = t->searchHashIndexForFieldName(L"name", false);
+        ASSERT_NE(nullptr, index);
+        for (unsigned int i = 0; i < names.size(); ++i) {
+            std::vector<wchar_t> key(names[i].begin(), names[i].end());
+            key.push_back(L'\0');
+            wcsupper(key.data());
+            bool found = false;
+            unsigned int id = 0, next = 0;
+            for (bool row = t->hashIndex_moveFirst(*index, key.data(), id, next); row && !found;
+                 row = t->hashIndex_moveNext(*index, id, next))
+                found = id == i;
+            EXPECT_TRUE(found) << "record " << i;
+        }
+    }
+    std::setlocale(LC_CTYPE, saved.c_str());
+    if (!utf8) GTEST_SKIP() << "no C.UTF-8 locale: only the C locale's upper case was tried";
+}

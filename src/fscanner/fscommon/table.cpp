@@ -962,12 +962,7 @@ bool FS_Table::peekPassesGuard(unsigned int id, uint32_t end) {
             }
             case FIELD_TEXT:
                 if (!peekedAscii(c)) return false;
-                if (!upperAsciiReady) {
-                    for (unsigned int b = 0; b < 128; ++b)
-                        upperAscii[b] = static_cast<uint32_t>(std::towupper(static_cast<wint_t>(b)));
-                    upperAsciiReady = true;
-                }
-                bucket = hashUpperAscii(peekBytes.data() + c.at, c.length, upperAscii);
+                bucket = hashUpperAscii(peekBytes.data() + c.at, c.length, upperAsciiTable());
                 break;
             default:
                 return false;
@@ -1206,23 +1201,36 @@ bool FS_Table::hashIndexesUpdate(Fields& record, unsigned int id) {
             if (!index->write(static_cast<unsigned int>(hash(key, Index::BUCKETS)), id))
                 written = noteWriteFailure(index->getIndexFullPathName());
         } else if (type == FIELD_TEXT) {
-            wchar_t const* text = static_cast<TextField*>(field)->value();
-            size_t n = wideLength(text);
-            wchar_t local[256];
-            wchar_t* upper = local;
-            if (n > 255) {
-                upper = static_cast<wchar_t*>(kelm_malloc((n + 1) * sizeof(wchar_t)));
-                if (upper == nullptr) return false;
-            }
-            if (text != nullptr) std::memcpy(upper, text, (n + 1) * sizeof(wchar_t));
-            else upper[0] = 0;
-            wcsupper(upper);
-            if (!index->write(static_cast<unsigned int>(hash(upper, Index::BUCKETS)), id))
+            int bucket = upperTextBucket(static_cast<TextField*>(field)->value());
+            if (!index->write(static_cast<unsigned int>(bucket), id))
                 written = noteWriteFailure(index->getIndexFullPathName());
-            if (upper != local) kelm_free(upper);
         }
     }
     return written;
+}
+
+const uint32_t* FS_Table::upperAsciiTable() {
+    if (!upperAsciiReady) {
+        for (unsigned int b = 0; b < 128; ++b) upperAscii[b] = static_cast<uint32_t>(std::towupper(static_cast<wint_t>(b)));
+        upperAsciiReady = true;
+    }
+    return upperAscii;
+}
+
+int FS_Table::upperTextBucket(wchar_t const* text) {
+    const uint32_t* upper = upperAsciiTable();
+    uint32_t acc = 0;
+    if (text != nullptr) {
+        for (; *text != L'\0'; ++text) {
+            uint32_t c = static_cast<uint32_t>(*text);
+            acc = acc * 37u + (c < 128 ? upper[c] : static_cast<uint32_t>(static_cast<wchar_t>(std::towupper(static_cast<wint_t>(*text)))));
+        }
+    }
+    acc = acc * 37u;  // the terminator
+    int32_t signedAcc = static_cast<int32_t>(acc);
+    int r = signedAcc % static_cast<int32_t>(Index::BUCKETS);
+    if (r < 0) r += static_cast<int>(Index::BUCKETS);
+    return r;
 }
 
 bool FS_Table::saveHashIndexList(std::vector<Index*>& list) {

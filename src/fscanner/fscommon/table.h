@@ -381,9 +381,14 @@ private:
     // Per entry of the guard's index list: its index and the column of its
     // key, found once.
     std::vector<std::pair<Index*, int>> peekGuardColumns;
-    // towupper of each ASCII code, for the index keys of peeked text.
+    // towupper of each ASCII code, for the index keys of peeked text and of
+    // inserted text; filled at the first use.
     uint32_t upperAscii[128];
     bool upperAsciiReady = false;
+    const uint32_t* upperAsciiTable();
+    // The bucket of text's key: hash() of text upper-cased as wcsupper does,
+    // without a copy of the text.
+    int upperTextBucket(wchar_t const* text);
 };
 
 #endif
