@@ -245,10 +245,10 @@ bool Index::erase() {
 bool Index::read(unsigned int slot, unsigned int* id, unsigned int* next) {
     if (file == nullptr) return false;
     if (!file->seek(static_cast<long>(static_cast<unsigned long long>(slot) * 8), SEEK_FROM_START)) return false;
-    uint32_t a, b;
-    if (!readWord(file, &a) || !readWord(file, &b)) return false;
-    *id = a;
-    *next = b;
+    char both[8];
+    if (file->read(both, 8) != 8) return false;
+    *id = codec::decodeFixed32(both);
+    *next = codec::decodeFixed32(both + 4);
     return true;
 }
 
@@ -261,22 +261,21 @@ bool Index::write(unsigned int bucket, unsigned int id) {
     if (file == nullptr) return false;
     unsigned int headId, headNext;
     if (!read(bucket, &headId, &headNext)) return false;
-    std::string word;
+    char word[8];
+    codec::encodeFixed32(word, id);
     if (headId == EMPTY) {
         file->seek(static_cast<long>(bucket) * 8, SEEK_FROM_START);
-        codec::putFixed32(&word, id);
-        return writeAll(file, word);
+        return file->write(word, 4) == 4;
     }
     if (!file->seek(0, SEEK_FROM_END)) return false;
     uint32_t newSlot = static_cast<uint32_t>(file->tell() / 8);
-    std::string moved;
-    codec::putFixed32(&moved, headId);
-    codec::putFixed32(&moved, headNext);
-    if (!writeAll(file, moved)) return false;
+    char moved[8];
+    codec::encodeFixed32(moved, headId);
+    codec::encodeFixed32(moved + 4, headNext);
+    if (file->write(moved, 8) != 8) return false;
     file->seek(static_cast<long>(bucket) * 8, SEEK_FROM_START);
-    codec::putFixed32(&word, id);
-    codec::putFixed32(&word, newSlot);
-    return writeAll(file, word);
+    codec::encodeFixed32(word + 4, newSlot);
+    return file->write(word, 8) == 8;
 }
 
 // ---- FS_Table: construction ---------------------------------------------------
