@@ -154,22 +154,38 @@ long long minorFaults() {
     return usage.ru_minflt;
 }
 
+// A new file of bytes (a multiple of kPiece) holding the test pattern.
+void writePatternFile(const std::string& path, uint32_t bytes) {
+    LinuxMmFile f(path.c_str());
+    ASSERT_TRUE(f.create());
+    std::vector<unsigned char> piece(kPiece);
+    for (uint32_t at = 0; at < bytes; at += kPiece) {
+        for (uint32_t k = 0; k < kPiece; ++k) piece[k] = patternAt(at + k);
+        ASSERT_EQ(kPiece, f.write(piece.data(), kPiece));
+    }
+    ASSERT_TRUE(f.close());
+}
+
+// count reads of 8 bytes at places drawn from seed inside the first span
+// bytes of f, each checked against the pattern.
+void readAtRandom(LinuxMmFile& f, uint32_t span, uint32_t count, uint32_t* seed) {
+    for (uint32_t i = 0; i < count; ++i) {
+        *seed = *seed * 1103515245u + 12345u;
+        uint32_t at = (*seed >> 4) % (span - 8);
+        unsigned char value[8];
+        ASSERT_TRUE(f.seek(static_cast<long>(at), SEEK_FROM_START));
+        ASSERT_EQ(8u, f.read(value, 8));
+        ASSERT_EQ(patternAt(at), value[0]) << "at " << at;
+    }
+}
+
 TEST(MmFileResident, AFileReadAtRandomKeepsItsWorkingSetInsteadOfFaultingItBack) {
     // 12 MiB, six times the first budget and inside the largest one: read at
     // random, the pages would come back by faults after every drop.
     const uint32_t bytes = 12u << 20;
     TempDir dir;
     std::string path = dir.file("random.bin");
-    {
-        LinuxMmFile f(path.c_str());
-        ASSERT_TRUE(f.create());
-        std::vector<unsigned char> piece(kPiece);
-        for (uint32_t at = 0; at < bytes; at += kPiece) {
-            for (uint32_t k = 0; k < kPiece; ++k) piece[k] = patternAt(at + k);
-            ASSERT_EQ(kPiece, f.write(piece.data(), kPiece));
-        }
-        ASSERT_TRUE(f.close());
-    }
+    ASSERT_NO_FATAL_FAILURE(writePatternFile(path, bytes));
     LinuxMmFile f(path.c_str());
     ASSERT_TRUE(f.open());
     const uint32_t pages = bytes / 4096;
@@ -177,14 +193,7 @@ TEST(MmFileResident, AFileReadAtRandomKeepsItsWorkingSetInsteadOfFaultingItBack)
     long long lastRoundFaults = 0;
     for (int round = 0; round < 6; ++round) {
         long long before = minorFaults();
-        for (uint32_t i = 0; i < pages; ++i) {
-            seed = seed * 1103515245u + 12345u;
-            uint32_t at = (seed >> 4) % (bytes - 8);
-            unsigned char value[8];
-            ASSERT_TRUE(f.seek(static_cast<long>(at), SEEK_FROM_START));
-            ASSERT_EQ(8u, f.read(value, 8));
-            ASSERT_EQ(patternAt(at), value[0]) << "at " << at;
-        }
+        ASSERT_NO_FATAL_FAILURE(readAtRandom(f, bytes, pages, &seed));
         lastRoundFaults = minorFaults() - before;
     }
     // Dropping everything at each budget would fault a good part of the
@@ -201,31 +210,14 @@ TEST(MmFileResident, APassDownwardsKeepsTheFirstBudgetAfterReadsAtRandom) {
     const uint32_t bytes = 32u << 20;
     TempDir dir;
     std::string path = dir.file("downwards.bin");
-    {
-        LinuxMmFile f(path.c_str());
-        ASSERT_TRUE(f.create());
-        std::vector<unsigned char> piece(kPiece);
-        for (uint32_t at = 0; at < bytes; at += kPiece) {
-            for (uint32_t k = 0; k < kPiece; ++k) piece[k] = patternAt(at + k);
-            ASSERT_EQ(kPiece, f.write(piece.data(), kPiece));
-        }
-        ASSERT_TRUE(f.close());
-    }
+    ASSERT_NO_FATAL_FAILURE(writePatternFile(path, bytes));
     LinuxMmFile f(path.c_str());
     ASSERT_TRUE(f.open());
     long long before = residentFileKib();
     // Reads at random over the first 12 MiB, as the growth test does.
     uint32_t seed = 777;
-    for (int round = 0; round < 6; ++round) {
-        for (uint32_t i = 0; i < (12u << 20) / 4096; ++i) {
-            seed = seed * 1103515245u + 12345u;
-            uint32_t at = (seed >> 4) % ((12u << 20) - 8);
-            unsigned char value[8];
-            ASSERT_TRUE(f.seek(static_cast<long>(at), SEEK_FROM_START));
-            ASSERT_EQ(8u, f.read(value, 8));
-            ASSERT_EQ(patternAt(at), value[0]) << "at " << at;
-        }
-    }
+    for (int round = 0; round < 6; ++round)
+        ASSERT_NO_FATAL_FAILURE(readAtRandom(f, 12u << 20, (12u << 20) / 4096, &seed));
     long long most = 0;
     std::vector<unsigned char> piece(kPiece);
     for (uint32_t end = bytes; end > 0; end -= kPiece) {

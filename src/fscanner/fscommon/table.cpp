@@ -150,10 +150,7 @@ int hash(wchar_t const* key, int buckets) {
             acc = acc * 37u + static_cast<uint32_t>(key[i]);
         } while (key[i++] != 0);
     }
-    int32_t signedAcc = static_cast<int32_t>(acc);
-    int r = signedAcc % buckets;
-    if (r < 0) r += buckets;
-    return r;
+    return hash(acc, buckets);
 }
 
 int hash(unsigned int value, int buckets) {
@@ -794,10 +791,7 @@ int hashUpperAscii(const unsigned char* text, uint32_t length, const uint32_t* u
     uint32_t acc = 0;
     for (uint32_t i = 0; i < length; ++i) acc = acc * 37u + upper[text[i]];
     acc = acc * 37u;  // the terminator
-    int32_t signedAcc = static_cast<int32_t>(acc);
-    int r = signedAcc % Index::BUCKETS;
-    if (r < 0) r += Index::BUCKETS;
-    return r;
+    return hash(acc, static_cast<int>(Index::BUCKETS));
 }
 
 // Most rows of the cache's tables are shorter than this; a longer one costs
@@ -815,10 +809,7 @@ int hashDecimal(unsigned int value) {
     uint32_t acc = 0;
     while (n > 0) acc = acc * 37u + static_cast<uint32_t>(digits[--n]);
     acc = acc * 37u;  // the terminator
-    int32_t signedAcc = static_cast<int32_t>(acc);
-    int r = signedAcc % Index::BUCKETS;
-    if (r < 0) r += Index::BUCKETS;
-    return r;
+    return hash(acc, static_cast<int>(Index::BUCKETS));
 }
 
 }  // namespace
@@ -1226,10 +1217,7 @@ int FS_Table::upperTextBucket(wchar_t const* text) {
         }
     }
     acc = acc * 37u;  // the terminator
-    int32_t signedAcc = static_cast<int32_t>(acc);
-    int r = signedAcc % static_cast<int32_t>(Index::BUCKETS);
-    if (r < 0) r += static_cast<int>(Index::BUCKETS);
-    return r;
+    return hash(acc, static_cast<int>(Index::BUCKETS));
 }
 
 bool FS_Table::saveHashIndexList(std::vector<Index*>& list) {

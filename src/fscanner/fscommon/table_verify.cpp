@@ -23,7 +23,8 @@
 // offsets and the stored count on its way, and checks each index whole
 // (verifyIndex) at its first key check, then answers from the index's map;
 // outside a walk, chain searches that add up to a share of an index's size
-// do the same.  So a query that reads every row pays for each index once.  verifyWhole() does all of it at once.
+// do the same.  So a query that reads every row pays for each index once.
+// verifyWhole() does all of it at once.
 //
 // A crash breaks some of these (padding, a count behind its slot): a table
 // left by a crash is never verified, since the cache refuses it by its
