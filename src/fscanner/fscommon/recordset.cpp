@@ -111,14 +111,13 @@ bool __recordSet::setCriteria(CriteriaEvaluator* criteria, bool caseSensitive) {
     return true;
 }
 
-// A record fits when no criteria are set or the evaluator accepts it.  The
-// evaluator has the last word on every candidate, also on those of a hash
-// chain, which holds collisions and stale entries.
-//
-// Criteria that are one comparison of an INT32 column with an INT32
-// variable (compareInt32) are decided here: the evaluator turns both sides
-// into numbers the same way, so they are equal exactly when the two 32-bit
-// values are.  A null side goes to the evaluator.
+// A record fits when no criteria are set or the criteria accept it.  Every
+// candidate is decided, also those of a hash chain, which holds collisions
+// and stale entries.  The evaluator decides, except for criteria that are
+// one comparison of an INT32 column with an INT32 variable (compareInt32):
+// the evaluator turns both sides into numbers the same way, so they are
+// equal exactly when the two 32-bit values are, and the cursor compares
+// them itself.  A null side still goes to the evaluator.
 bool __recordSet::fits() {
     if (!hasCriteria) return true;
     if (equalColumn >= 0) {
