@@ -136,6 +136,18 @@ bool __recordSet::compareInt32(unsigned int column, Field* variable) {
     return true;
 }
 
+bool __recordSet::rejectsName(void* context, const unsigned char* bytes, uint32_t length) {
+    __recordSet* self = static_cast<__recordSet*>(context);
+    return !self->nameFilter->mayMatchAscii(bytes, length, self->caseFlag);
+}
+
+bool __recordSet::moveToCandidate() {
+    // Rows whose name the byte test turns away are passed over in the
+    // table; the next one is read here.
+    if (nameFilter != nullptr) table->skipRejected(id, nameFilter->getColumn(), rejectsName, this);
+    return table->moveNext(id);
+}
+
 bool __recordSet::readAndDecide(bool* accepted) {
     if (nameFilter != nullptr) {
         const unsigned char* text = nullptr;
@@ -173,7 +185,7 @@ bool __recordSet::moveFirst() {
             position = 0;
             return true;
         }
-        if (!table->moveNext(id)) return false;
+        if (!moveToCandidate()) return false;
     }
 }
 
@@ -190,7 +202,7 @@ bool __recordSet::moveNext() {
         }
     }
     for (;;) {
-        if (!table->moveNext(id)) return false;
+        if (!moveToCandidate()) return false;
         bool accepted = false;
         if (!readAndDecide(&accepted)) return false;
         if (accepted) {

@@ -115,6 +115,9 @@ private:
     // filter, decides from the stored name alone a record that can not fit
     // (the buffer is then left as it was).  False when the read fails.
     bool readAndDecide(bool* accepted);
+    // moveNext of the walk, past the rows the name filter turns away.
+    bool moveToCandidate();
+    static bool rejectsName(void* context, const unsigned char* bytes, uint32_t length);
 
     unsigned int id;
     unsigned int position;

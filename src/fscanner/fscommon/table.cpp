@@ -22,6 +22,10 @@ using namespace tableformat;
 
 namespace {
 
+// The mark upperAsciiTable() holds for bytes no plain ASCII text holds; no
+// character's upper case has this bit.
+const uint32_t kNotPlainAscii = 0x80000000u;
+
 // Closes and deletes file, if there is one, and leaves the pointer null.
 void closeAndDrop(AbstractFile*& file) {
     if (file == nullptr) return;
@@ -787,10 +791,18 @@ namespace {
 
 // hash() of the towupper form of an ASCII text, terminator included, as an
 // index files the key.
-int hashUpperAscii(const unsigned char* text, uint32_t length, const uint32_t* upper) {
+// plain says whether the text is plain ASCII (1..127): only then is the
+// answer the bucket.  upper is FS_Table::upperAsciiTable().
+int hashUpperAscii(const unsigned char* text, uint32_t length, const uint32_t* upper, bool* plain) {
     uint32_t acc = 0;
-    for (uint32_t i = 0; i < length; ++i) acc = acc * 37u + upper[text[i]];
+    uint32_t marks = 0;
+    for (uint32_t i = 0; i < length; ++i) {
+        uint32_t u = upper[text[i]];
+        acc = acc * 37u + u;
+        marks |= u;
+    }
     acc = acc * 37u;  // the terminator
+    *plain = (marks & kNotPlainAscii) == 0;
     return hash(acc, static_cast<int>(Index::BUCKETS));
 }
 
@@ -814,76 +826,56 @@ int hashDecimal(unsigned int value) {
 
 }  // namespace
 
-bool FS_Table::peekRecord(uint32_t offset, Fields& layout, uint32_t* end) {
+FS_Table::PeekDecode FS_Table::decodePeeked(const unsigned char* bytes, uint32_t available, bool complete,
+                                             Fields& layout, uint32_t* length) {
     unsigned int count = layout.count();
-    if (count == 0 || !dataFile->seek(static_cast<long>(offset), SEEK_FROM_START)) return false;
+    if (count == 0) return PeekDecode::Broken;
     if (peekColumns.size() < count) peekColumns.resize(count);
-    if (peekBytes.size() < kPeekFirstRead) peekBytes.resize(kPeekFirstRead);
-    uint32_t have = dataFile->read(peekBytes.data(), kPeekFirstRead);
-    // Makes the first n bytes of the record present; reads go on where the
-    // last one stopped.
-    auto ensure = [&](uint32_t n) -> bool {
-        if (n <= have) return true;
-        if (n > peekBytes.size()) peekBytes.resize(n > 2 * peekBytes.size() ? n : 2 * peekBytes.size());
-        have += dataFile->read(peekBytes.data() + have, static_cast<unsigned int>(peekBytes.size() - have));
-        return n <= have;
+    // More bytes than are present: the caller fetches need of them and asks
+    // again, or, when the file holds no more, the record is broken.
+    auto more = [&](uint64_t need) -> PeekDecode {
+        if (complete || need > 0xFFFFFFFFull) return PeekDecode::Broken;
+        *length = static_cast<uint32_t>(need);
+        return PeekDecode::NeedMore;
     };
-    // The variable-length integer at pos, as readValue takes it.
-    auto compressedAt = [&](uint32_t pos, uint32_t* used, unsigned long long* value) -> bool {
-        const uint32_t longest = static_cast<uint32_t>(codec::kMaxCompressedLength);
-        if (pos + longest <= have || ensure(pos + longest)) {
-            // Every byte the encoding may take is present.
-            uint64_t v = 0;
-            int n = codec::decodeCompressed(reinterpret_cast<const char*>(peekBytes.data() + pos), longest, &v);
-            if (n == 0) return false;
-            *used = static_cast<uint32_t>(n);
-            *value = v;
-            return true;
-        }
-        // Near the end of the file: byte by byte, as far as there are bytes.
-        uint32_t n = 0;
-        for (;;) {
-            if (n == static_cast<uint32_t>(codec::kMaxCompressedLength)) return false;
-            if (!ensure(pos + n + 1)) return false;
-            if ((peekBytes[pos + n++] & 1) == 0) break;
-        }
-        uint64_t v = 0;
-        if (codec::decodeCompressed(reinterpret_cast<const char*>(peekBytes.data() + pos), n, &v) == 0) return false;
-        *used = n;
-        *value = v;
-        return true;
-    };
+    const char* at = reinterpret_cast<const char*>(bytes);
     uint32_t pos = bitmapSize <= kBitmapBufferSize ? bitmapSize : kBitmapBufferSize;
-    if (!ensure(pos)) return false;
+    if (pos > available) return more(pos);
     for (unsigned int i = 0; i < count; ++i) {
         PeekedColumn& c = peekColumns[i];
         unsigned int type = layout.at(i)->getType();
         c.length = 0;
         c.number = 0;
         c.ascii = -1;
+        // The variable-length integer at pos, as readValue takes it: it
+        // ends inside the bytes present, or where the file ends.
+        uint64_t v = 0;
+        uint32_t used = 0;
+        auto compressedAt = [&]() -> PeekDecode {
+            const uint32_t longest = static_cast<uint32_t>(codec::kMaxCompressedLength);
+            uint32_t room = available - pos;
+            int n = codec::decodeCompressed(at + pos, room, &v);
+            if (n != 0) {
+                used = static_cast<uint32_t>(n);
+                return PeekDecode::Done;
+            }
+            return room >= longest ? PeekDecode::Broken : more(static_cast<uint64_t>(pos) + longest);
+        };
         if (type == FIELD_INT8) {
-            if (!ensure(pos + 1)) return false;
+            if (pos + 1ull > available) return more(pos + 1ull);
             c.at = pos;
-            c.number = peekBytes[pos];
+            c.number = bytes[pos];
             pos += 1;
         } else if (type == FIELD_INT16 || type == FIELD_INT32 || type == FIELD_INT64) {
-            unsigned long long v = 0;
-            uint32_t used = 0;
-            const char* at = reinterpret_cast<const char*>(peekBytes.data());
             if (compressed) {
-                if (!compressedAt(pos, &used, &v)) return false;
-            } else if (type == FIELD_INT16) {
-                used = 2;
-                if (!ensure(pos + used)) return false;
-                v = codec::decodeFixed16(at + pos);
-            } else if (type == FIELD_INT32) {
-                used = 4;
-                if (!ensure(pos + used)) return false;
-                v = codec::decodeFixed32(reinterpret_cast<const char*>(peekBytes.data()) + pos);
+                PeekDecode r = compressedAt();
+                if (r != PeekDecode::Done) return r;
             } else {
-                used = 8;
-                if (!ensure(pos + used)) return false;
-                v = codec::decodeFixed64(reinterpret_cast<const char*>(peekBytes.data()) + pos);
+                used = type == FIELD_INT16 ? 2 : type == FIELD_INT32 ? 4 : 8;
+                if (pos + static_cast<uint64_t>(used) > available) return more(pos + static_cast<uint64_t>(used));
+                v = type == FIELD_INT16   ? codec::decodeFixed16(at + pos)
+                    : type == FIELD_INT32 ? codec::decodeFixed32(at + pos)
+                                          : codec::decodeFixed64(at + pos);
             }
             // The value as the field would keep it.
             if (type == FIELD_INT16) v = static_cast<unsigned short>(v);
@@ -892,28 +884,93 @@ bool FS_Table::peekRecord(uint32_t offset, Fields& layout, uint32_t* end) {
             c.number = v;
             pos += used;
         } else if (type == FIELD_TEXT) {
-            uint32_t length = 0;
-            uint32_t used = 0;
+            uint32_t textLength = 0;
             if (compressed) {
-                unsigned long long v = 0;
-                if (!compressedAt(pos, &used, &v) || v > 0xFFFFull) return false;
-                length = static_cast<uint32_t>(v);
+                PeekDecode r = compressedAt();
+                if (r != PeekDecode::Done) return r;
+                if (v > 0xFFFFull) return PeekDecode::Broken;
+                textLength = static_cast<uint32_t>(v);
             } else {
                 used = 2;
-                if (!ensure(pos + used)) return false;
-                length = codec::decodeFixed16(reinterpret_cast<const char*>(peekBytes.data()) + pos);
+                if (pos + 2ull > available) return more(pos + 2ull);
+                textLength = codec::decodeFixed16(at + pos);
             }
             pos += used;
-            if (!ensure(pos + length)) return false;
+            if (pos + static_cast<uint64_t>(textLength) > available) return more(pos + static_cast<uint64_t>(textLength));
             c.at = pos;
-            c.length = length;
-            pos += length;
+            c.length = textLength;
+            pos += textLength;
         } else {
-            return false;  // type 6 is never stored: read() fails on it
+            return PeekDecode::Broken;  // type 6 is never stored: read() fails on it
         }
     }
-    *end = offset + pos;
-    return true;
+    *length = pos;
+    return PeekDecode::Done;
+}
+
+bool FS_Table::peekRecord(uint32_t offset, Fields& layout, uint32_t* end) {
+    if (layout.count() == 0 || !dataFile->seek(static_cast<long>(offset), SEEK_FROM_START)) return false;
+    if (peekBytes.size() < kPeekFirstRead) peekBytes.resize(kPeekFirstRead);
+    uint32_t have = dataFile->read(peekBytes.data(), kPeekFirstRead);
+    bool complete = false;
+    for (;;) {
+        uint32_t n = 0;
+        PeekDecode r = decodePeeked(peekBytes.data(), have, complete, layout, &n);
+        if (r == PeekDecode::Done) {
+            *end = offset + n;
+            return true;
+        }
+        if (r == PeekDecode::Broken) return false;
+        // Reads go on where the last one stopped.
+        if (n > peekBytes.size()) peekBytes.resize(n > 2 * peekBytes.size() ? n : 2 * peekBytes.size());
+        have += dataFile->read(peekBytes.data() + have, static_cast<unsigned int>(peekBytes.size() - have));
+        // The file ends before: decide on the bytes it has.
+        if (n > have) complete = true;
+    }
+}
+
+int FS_Table::peekGuardColumn(size_t k) {
+    TableGuard::IndexBuckets& entry = guard->indexes[k];
+    // The first column of that name, as Fields::name finds it; the answer is
+    // kept per index entry, whose field never changes.
+    if (peekGuardColumns.size() != guard->indexes.size()) peekGuardColumns.assign(guard->indexes.size(), {nullptr, -1});
+    if (peekGuardColumns[k].first != entry.index) {
+        int found = -1;
+        for (unsigned int i = 0; i < schema.count() && found < 0; ++i) {
+            wchar_t const* n = schema.at(i)->getName();
+            if (n != nullptr && entry.field == n) found = static_cast<int>(i);
+        }
+        peekGuardColumns[k] = {entry.index, found};
+    }
+    return peekGuardColumns[k].second;
+}
+
+bool FS_Table::peekedBucket(unsigned int column, const unsigned char* bytes, int* bucket) {
+    PeekedColumn& c = peekColumns[column];
+    switch (schema.at(column)->getType()) {
+        case FIELD_INT8:
+        case FIELD_INT16:
+        case FIELD_INT32:
+        case FIELD_INT64: {
+            // Keyed by the low 32 bits, as the index writes it.
+            uint32_t key = static_cast<uint32_t>(c.number);
+            if (lastDecimalBucket < 0 || key != lastDecimal) {
+                lastDecimal = key;
+                lastDecimalBucket = hashDecimal(key);
+            }
+            *bucket = lastDecimalBucket;
+            return true;
+        }
+        case FIELD_TEXT: {
+            if (c.ascii == 0) return false;
+            bool plain = false;
+            *bucket = hashUpperAscii(bytes + c.at, c.length, upperAsciiTable(), &plain);
+            c.ascii = plain ? 1 : 0;
+            return plain;
+        }
+        default:
+            return false;
+    }
 }
 
 bool FS_Table::peekPassesGuard(unsigned int id, uint32_t end) {
@@ -925,38 +982,10 @@ bool FS_Table::peekPassesGuard(unsigned int id, uint32_t end) {
         bool current = false;
         for (Index* index : indexes) current = current || index == entry.index;
         if (!current) continue;
-        // The first column of that name, as Fields::name finds it; the
-        // answer is kept per index entry, whose field never changes.
-        size_t k = static_cast<size_t>(&entry - guard->indexes.data());
-        if (peekGuardColumns.size() != guard->indexes.size()) peekGuardColumns.assign(guard->indexes.size(), {nullptr, -1});
-        if (peekGuardColumns[k].first != entry.index) {
-            int found = -1;
-            for (unsigned int i = 0; i < schema.count() && found < 0; ++i) {
-                wchar_t const* n = schema.at(i)->getName();
-                if (n != nullptr && entry.field == n) found = static_cast<int>(i);
-            }
-            peekGuardColumns[k] = {entry.index, found};
-        }
-        int column = peekGuardColumns[k].second;
+        int column = peekGuardColumn(static_cast<size_t>(&entry - guard->indexes.data()));
         if (column < 0) continue;
-        PeekedColumn& c = peekColumns[static_cast<size_t>(column)];
         int bucket = -1;
-        switch (schema.at(static_cast<unsigned int>(column))->getType()) {
-            case FIELD_INT8:
-            case FIELD_INT16:
-            case FIELD_INT32:
-            case FIELD_INT64: {
-                // Keyed by the low 32 bits, as the index writes it.
-                bucket = hashDecimal(static_cast<unsigned int>(c.number));
-                break;
-            }
-            case FIELD_TEXT:
-                if (!peekedAscii(c)) return false;
-                bucket = hashUpperAscii(peekBytes.data() + c.at, c.length, upperAsciiTable());
-                break;
-            default:
-                return false;
-        }
+        if (!peekedBucket(static_cast<unsigned int>(column), peekBytes.data(), &bucket)) return false;
         // A key that is not where its record is filed is damage whichever
         // read meets it; the guarded read that follows finds it noted.
         if (bucket >= 0 && !guardFiled(entry, id, static_cast<uint32_t>(bucket))) return false;
@@ -964,8 +993,8 @@ bool FS_Table::peekPassesGuard(unsigned int id, uint32_t end) {
     return true;
 }
 
-bool FS_Table::peekedAscii(PeekedColumn& c) {
-    if (c.ascii < 0) c.ascii = isPlainAscii(peekBytes.data() + c.at, c.length) ? 1 : 0;
+bool FS_Table::peekedAscii(PeekedColumn& c, const unsigned char* bytes) {
+    if (c.ascii < 0) c.ascii = isPlainAscii(bytes + c.at, c.length) ? 1 : 0;
     return c.ascii == 1;
 }
 
@@ -982,8 +1011,134 @@ bool FS_Table::peekText(unsigned int id, unsigned int column, const unsigned cha
     if (!peekRecord(offset, schema, &end) || !peekPassesGuard(id, end)) return false;
     *text = peekBytes.data() + peekColumns[column].at;
     *length = peekColumns[column].length;
-    if (ascii != nullptr) *ascii = peekedAscii(peekColumns[column]);
+    if (ascii != nullptr) *ascii = peekedAscii(peekColumns[column], peekBytes.data());
     return true;
+}
+
+namespace {
+
+// skipRejected reads slots and records in blocks that start small, since a
+// filter that lets many rows through stops it after a few, and double while
+// it goes on.
+const uint32_t kSkipFirstSlots = 32;
+const uint32_t kSkipMostSlots = 1024;
+const uint32_t kSkipFirstBytes = 1024;
+const uint32_t kSkipMostBytes = 0x10000;
+
+}  // namespace
+
+void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject reject, void* context) {
+    if (dataFile == nullptr || pointerFile == nullptr || guard == nullptr || reject == nullptr) return;
+    // A row check needs the decoded record; a walk that does not stand at id
+    // is for moveNext to end.
+    if (guard->damaged || guard->rowCheck != nullptr || !guard->walking || guard->walkAt != id) return;
+    unsigned int count = schema.count();
+    if (count == 0 || count > kMaxFields || column >= count || schema.at(column)->getType() != FIELD_TEXT) return;
+    // The key checks of peekPassesGuard, each answered by a whole index:
+    // an index not yet checked whole is for the reads to check.
+    const unsigned int kMostKeys = 16;
+    TableGuard::IndexBuckets* keyEntry[kMostKeys];
+    unsigned int keyColumn[kMostKeys];
+    unsigned int keys = 0;
+    for (size_t k = 0; k < guard->indexes.size(); ++k) {
+        TableGuard::IndexBuckets& entry = guard->indexes[k];
+        bool current = false;
+        for (Index* index : indexes) current = current || index == entry.index;
+        if (!current) continue;
+        int keyAt = peekGuardColumn(k);
+        if (keyAt < 0) continue;
+        if (!entry.whole || keys == kMostKeys) return;
+        keyEntry[keys] = &entry;
+        keyColumn[keys++] = static_cast<unsigned int>(keyAt);
+    }
+
+    uint32_t slots[kSkipMostSlots];
+    uint32_t wantSlots = kSkipFirstSlots;
+    uint32_t base = 0;  // the number of slots[0]
+    uint32_t haveSlots = 0;
+    bool slotsEnd = false;  // the pointer file ends behind slots[haveSlots - 1]
+    // Slots from number first on, as readSlot reads them.
+    auto readSlots = [&](uint64_t first) -> bool {
+        uint64_t position = first * kSlotSize;
+        if (position + static_cast<uint64_t>(wantSlots) * kSlotSize > 0x7FFFFFFFull ||
+            !pointerFile->seek(static_cast<long>(position), SEEK_FROM_START))
+            return false;
+        unsigned char bytes[kSkipMostSlots * kSlotSize];
+        uint32_t got = pointerFile->read(bytes, wantSlots * kSlotSize) / kSlotSize;
+        for (uint32_t i = 0; i < got; ++i) slots[i] = codec::decodeFixed32(reinterpret_cast<const char*>(bytes) + i * kSlotSize);
+        base = static_cast<uint32_t>(first);
+        haveSlots = got;
+        slotsEnd = got < wantSlots;
+        if (wantSlots < kSkipMostSlots) wantSlots *= 2;
+        return true;
+    };
+    if (id == 0xFFFFFFFFu || !readSlots(static_cast<uint64_t>(id) + 1)) return;
+
+    uint32_t wantBytes = kSkipFirstBytes;
+    uint32_t windowStart = 0, windowHave = 0;
+    bool windowEnd = false;  // the data file ends behind the window
+    uint32_t n = base;
+    for (;;) {
+        if (n - base >= haveSlots) {
+            // The file's end is for moveNext, which checks the walk's count.
+            if (slotsEnd || !readSlots(n) || haveSlots == 0) return;
+        }
+        uint32_t offset = slots[n - base];
+        if (offset == kRemovedSlot) {
+            ++n;
+            continue;
+        }
+        // guardWalkLive's and guardSlot's checks, on the sizes known so far.
+        if (offset < guard->header || offset >= guard->dataSize) return;
+        if (guard->walkLive >= 1 && offset <= guard->walkLastOffset) return;
+        // The next slot, as peekPassesGuard reads it: unreadable past the
+        // end of the pointer file.
+        if (n == 0xFFFFFFFFu) return;
+        bool nextKnown = n + 1 - base < haveSlots;
+        if (!nextKnown && !slotsEnd) {
+            if (!readSlots(n)) return;
+            continue;
+        }
+        // The record, from the window or from a new one that starts with it.
+        uint32_t length = 0;
+        PeekDecode decoded = PeekDecode::NeedMore;
+        bool inWindow = offset >= windowStart && offset - windowStart <= windowHave;
+        for (int attempt = 0; attempt < 2 && decoded == PeekDecode::NeedMore; ++attempt) {
+            if (!inWindow) {
+                if (!dataFile->seek(static_cast<long>(offset), SEEK_FROM_START)) return;
+                if (skipBytes.size() < wantBytes) skipBytes.resize(wantBytes);
+                windowStart = offset;
+                windowHave = dataFile->read(skipBytes.data(), wantBytes);
+                windowEnd = windowHave < wantBytes;
+                if (wantBytes < kSkipMostBytes) wantBytes *= 2;
+            }
+            uint32_t at = offset - windowStart;
+            decoded = decodePeeked(skipBytes.data() + at, windowHave - at, windowEnd, schema, &length);
+            if (decoded == PeekDecode::NeedMore) {
+                if (length > kSkipMostBytes) return;
+                while (wantBytes < length) wantBytes *= 2;
+                inWindow = false;
+            }
+        }
+        if (decoded != PeekDecode::Done) return;
+        const unsigned char* record = skipBytes.data() + (offset - windowStart);
+        uint32_t end = offset + length;
+        if (nextKnown && slots[n + 1 - base] != kRemovedSlot && slots[n + 1 - base] != end) return;
+        for (unsigned int k = 0; k < keys; ++k) {
+            int bucket = -1;
+            if (guard->reachedIndex == keyEntry[k]->index && guard->reachedId == n) return;
+            if (!peekedBucket(keyColumn[k], record, &bucket)) return;
+            if (bucket >= 0 && !keyEntry[k]->holds(n, static_cast<uint32_t>(bucket))) return;
+        }
+        PeekedColumn& text = peekColumns[column];
+        if (!peekedAscii(text, record) || !reject(context, record + text.at, text.length)) return;
+        // Passed over: counted as moveNext counts a live slot.
+        ++guard->walkLive;
+        guard->walkAt = n;
+        guard->walkLastOffset = offset;
+        id = n;
+        ++n;
+    }
 }
 
 bool FS_Table::update(unsigned int id, Fields& record) {
@@ -1201,7 +1356,8 @@ bool FS_Table::hashIndexesUpdate(Fields& record, unsigned int id) {
 
 const uint32_t* FS_Table::upperAsciiTable() {
     if (!upperAsciiReady) {
-        for (unsigned int b = 0; b < 128; ++b) upperAscii[b] = static_cast<uint32_t>(std::towupper(static_cast<wint_t>(b)));
+        for (unsigned int b = 0; b < 256; ++b)
+            upperAscii[b] = b != 0 && b < 128 ? static_cast<uint32_t>(std::towupper(static_cast<wint_t>(b))) : kNotPlainAscii;
         upperAsciiReady = true;
     }
     return upperAscii;

@@ -135,6 +135,19 @@ public:
     // ascii, when not null, tells whether the bytes are plain ASCII (1..127).
     bool peekText(unsigned int id, unsigned int column, const unsigned char** text, uint32_t* length,
                   bool* ascii = nullptr);
+    // A walk's way past the rows a filter on one text column turns away.
+    // From id, where a walk (moveFirst, moveNext) stands, passes over the
+    // following live rows whose text column column is plain ASCII that
+    // reject(context, bytes, length) answers true for, each only when every
+    // check peekText would make on it passes, and counts them into the walk
+    // as moveNext does.  Stops before the first row it cannot pass so (one
+    // the filter may want, one that fails a check or needs a check only a
+    // read makes, the end of the pointer file) and leaves id at the last row
+    // passed over: the walk goes on with moveNext and a full read of that
+    // row, which note any damage.  Nothing is noted here.  Without the guard,
+    // or outside a walk, it passes over nothing.
+    typedef bool (*TextReject)(void* context, const unsigned char* bytes, uint32_t length);
+    void skipRejected(unsigned int& id, unsigned int column, TextReject reject, void* context);
     // Plain table: overwrites in place unless a text changes its character
     // count, in which case the record moves to a new number.  Compressed
     // table: always moves.  The new number is not reported.  A move whose
@@ -297,6 +310,14 @@ private:
     // the end of the record, and per column where its bytes begin in
     // peekBytes and its value; false where readRecord would fail.
     bool peekRecord(uint32_t offset, Fields& layout, uint32_t* end);
+    // The decoding under peekRecord, on available bytes of a record held in
+    // memory from its first byte: Done with the record's length, NeedMore
+    // with the bytes it needs at least (never when complete says the file
+    // holds no more), or Broken where readRecord would fail.  Column offsets
+    // in peekColumns are from bytes.
+    enum class PeekDecode { Done, NeedMore, Broken };
+    PeekDecode decodePeeked(const unsigned char* bytes, uint32_t available, bool complete, Fields& layout,
+                            uint32_t* length);
     // Stores the columns the last peekRecord found into the first count
     // fields of record, as the field-by-field read would; false when a text
     // finds no memory (the fields before it are stored).
@@ -376,19 +397,33 @@ private:
         unsigned long long number;
         int ascii;  // text: -1 not yet known, 0 no, 1 plain ASCII
     };
-    bool peekedAscii(PeekedColumn& c);
+    bool peekedAscii(PeekedColumn& c, const unsigned char* bytes);
     std::vector<PeekedColumn> peekColumns;
     // Per entry of the guard's index list: its index and the column of its
     // key, found once.
     std::vector<std::pair<Index*, int>> peekGuardColumns;
+    int peekGuardColumn(size_t k);
+    // The bucket of the key a peeked column holds (bytes as given to
+    // decodePeeked); false where only the full read can tell (text that is
+    // not plain ASCII).
+    bool peekedBucket(unsigned int column, const unsigned char* bytes, int* bucket);
+
     // towupper of each ASCII code, for the index keys of peeked text and of
     // inserted text; filled at the first use.
-    uint32_t upperAscii[128];
+    // Entries 0 and 128..255, which no plain ASCII text holds, are
+    // kNotPlainAscii.
+    uint32_t upperAscii[256];
     bool upperAsciiReady = false;
     const uint32_t* upperAsciiTable();
     // The bucket of text's key: hash() of text upper-cased as wcsupper does,
     // without a copy of the text.
     int upperTextBucket(wchar_t const* text);
+    // skipRejected's copy of the records it looks at.
+    std::vector<unsigned char> skipBytes;
+    // The last number peekedBucket hashed, and its bucket: the rows of one
+    // directory follow each other and share their PATHID.
+    uint32_t lastDecimal = 0;
+    int lastDecimalBucket = -1;
 };
 
 #endif

@@ -477,10 +477,7 @@ bool FS_Table::guardFiled(TableGuard::IndexBuckets& entry, unsigned int id, uint
     if (!entry.whole && (guard->walking || entry.searched > searchBudget(entry.slots)) &&
         !verifyIndex(entry, contentSize(pointerFile) / kSlotSize))
         return false;
-    if (entry.whole) {
-        if (id >= entry.bucketOf.size() || entry.bucketOf[id] == TableGuard::UNKNOWN_BUCKET) return true;
-        return entry.bucketOf[id] == bucket || noteDamage(index.getIndexFullPathName(), misfiled);
-    }
+    if (entry.whole) return entry.holds(id, bucket) || noteDamage(index.getIndexFullPathName(), misfiled);
     // The record's number must be on its key's chain.  Every link is checked
     // before it is followed, so the walk ends within the index's slots.
     uint32_t slot = bucket;

@@ -35,6 +35,11 @@ struct TableGuard {
         uint32_t slots = 0;
         // Valid when whole: the bucket each record number is filed under.
         std::vector<uint32_t> bucketOf;
+        // When whole: record id, whose key falls in bucket, is filed there
+        // (or has no entry).
+        bool holds(uint32_t id, uint32_t bucket) const {
+            return id >= bucketOf.size() || bucketOf[id] == UNKNOWN_BUCKET || bucketOf[id] == bucket;
+        }
     };
 
     // Where a chain being walked by a lookup came from: the overflow slot
