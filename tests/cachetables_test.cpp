@@ -260,7 +260,10 @@ TEST_F(LookupTest, PathByIdRefusesABufferTooSmallInsteadOfCutting)
     standardTree();
     // "/usr/bin" is 8 characters; the prepend needs its length plus 4.
     EXPECT_EQ(L"<false:>", byId(3, 10));
+    EXPECT_EQ(L"<false:>", byId(3, 11));
     EXPECT_EQ(L"/usr/bin", byId(3, 12));
+    EXPECT_EQ(L"/", byId(1, 5));
+    EXPECT_EQ(L"<false:>", byId(1, 4));
 }
 
 TEST_F(LookupTest, PathByIdFailsOnABrokenChain)

@@ -349,7 +349,22 @@ bool FS_CacheBase::findPathById(RecordSet& directories, unsigned int id, wchar_t
     if (buffer == nullptr || size == 0)
         return false;
     buffer[0] = L'\0';
-    wchar_t separator[2] = {PathHelper::PathSeparator, L'\0'};
+    // The path grows from the leaf up, so it is built at the end of the
+    // buffer, each component in front of the last, and moved to the start
+    // once.  A component fits as long as the path stays 4 characters short
+    // of size.
+    size_t length = 0;
+    size_t start = size - 1;
+    buffer[start] = L'\0';
+    auto prepend = [&](wchar_t const* text, size_t n) -> bool {
+        if (n + length + 4 > size)
+            return false;
+        start -= n;
+        wmemcpy(buffer + start, text, n);
+        length += n;
+        return true;
+    };
+    const wchar_t separator = PathHelper::PathSeparator;
     unsigned int current = id;
     while (current != 0) {
         bool failed = false;
@@ -401,10 +416,10 @@ bool FS_CacheBase::findPathById(RecordSet& directories, unsigned int id, wchar_t
             failed = true;
         if (!failed) {
             size_t n = wcslen(component);
-            if (buffer[0] != L'\0' && (n == 0 || component[n - 1] != PathHelper::PathSeparator))
-                failed = wcs_stringCat(separator, buffer, size) == 0;
+            if (length != 0 && (n == 0 || component[n - 1] != PathHelper::PathSeparator))
+                failed = !prepend(&separator, 1);
             if (!failed)
-                failed = wcs_stringCat(component, buffer, size) == 0;
+                failed = !prepend(component, n);
         }
         if (failed) {
             // current is never 0 inside the loop: a broken walk is a failure.
@@ -413,7 +428,8 @@ bool FS_CacheBase::findPathById(RecordSet& directories, unsigned int id, wchar_t
         }
         current = parent;
     }
-    return buffer[0] != L'\0';
+    wmemmove(buffer, buffer + start, length + 1);
+    return length != 0;
 }
 
 void FS_CacheBase::removeFiles(FS_Table* files, unsigned int pathId)

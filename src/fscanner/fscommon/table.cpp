@@ -854,6 +854,12 @@ FS_Table::PeekDecode FS_Table::decodePeeked(const unsigned char* bytes, uint32_t
         auto compressedAt = [&]() -> PeekDecode {
             const uint32_t longest = static_cast<uint32_t>(codec::kMaxCompressedLength);
             uint32_t room = available - pos;
+            // Most values of the cache's rows take one group.
+            if (room != 0 && (bytes[pos] & 1) == 0) {
+                v = bytes[pos] >> 1;
+                used = 1;
+                return PeekDecode::Done;
+            }
             int n = codec::decodeCompressed(at + pos, room, &v);
             if (n != 0) {
                 used = static_cast<uint32_t>(n);
