@@ -310,24 +310,27 @@ unsigned int LinuxMmFile::read(void* buffer, unsigned int length) {
         eofFlag = 1;
         return 0;
     }
-    unsigned int copied;
-    if (static_cast<unsigned long long>(position) + length > logical) {
-        copied = logical - position;
-        eofFlag = 1;
-    } else {
-        copied = length;
-        eofFlag = 0;
-    }
-    if (copied != 0) {
-        std::memcpy(buffer, address + position, copied);
+    eofFlag = static_cast<unsigned long long>(position) + length > logical ? 1 : 0;
+    uint32_t copied = 0;
+    const char* from = view(position, length, &copied);
+    if (copied != 0) std::memcpy(buffer, from, copied);
+    position += copied;
+    return copied;
+}
+
+const char* LinuxMmFile::view(uint32_t at, uint32_t length, uint32_t* got) {
+    *got = 0;
+    if (address == kUnmapped || at > logical) return nullptr;
+    uint32_t n = static_cast<unsigned long long>(at) + length > logical ? logical - at : length;
+    if (n != 0) {
         // Most reads stay inside the page of the last access, which has
         // nothing new to count.
         const unsigned int shift = pageShift();
-        if ((position >> shift) != lastPage || ((static_cast<uint64_t>(position) + copied - 1) >> shift) != lastPage)
-            touched(position, copied, true);
+        if ((at >> shift) != lastPage || ((static_cast<uint64_t>(at) + n - 1) >> shift) != lastPage)
+            touched(at, n, true);
     }
-    position += copied;
-    return copied;
+    *got = n;
+    return address + at;
 }
 
 unsigned int LinuxMmFile::write(void* buffer, unsigned int length) {

@@ -195,6 +195,11 @@ public:
     uint32_t logicalSize() const { return logical; }
     uint32_t allocatedSize() const { return allocated; }
     bool isOpen() const { return fd != -1; }
+    // The bytes [at, at + length) in place, cut at the logical end (*got of
+    // them), as read() would copy them and counted as read; null with *got 0
+    // when nothing is mapped.  Valid until the next write, close or
+    // remapping; the position is left alone.
+    const char* view(uint32_t at, uint32_t length, uint32_t* got);
 
 private:
     LinuxMmFile(const LinuxMmFile&) = delete;

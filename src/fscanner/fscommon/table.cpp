@@ -1023,9 +1023,10 @@ bool FS_Table::peekText(unsigned int id, unsigned int column, const unsigned cha
 
 namespace {
 
-// skipRejected reads slots and records in blocks that start small, since a
-// filter that lets many rows through stops it after a few, and double while
-// it goes on.
+// skipRejected looks at slots and records in blocks of the mapping (each
+// counted as read for the mapping's resident pages) that start small, since
+// a filter that lets many rows through stops it after a few, and double
+// while it goes on.
 const uint32_t kSkipFirstSlots = 32;
 const uint32_t kSkipMostSlots = 1024;
 const uint32_t kSkipFirstBytes = 1024;
@@ -1058,6 +1059,10 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
         keyColumn[keys++] = static_cast<unsigned int>(keyAt);
     }
 
+    // The table's files are mapped and lend their bytes in place.
+    LinuxMmFile* mappedSlots = dynamic_cast<LinuxMmFile*>(pointerFile);
+    LinuxMmFile* mappedData = dynamic_cast<LinuxMmFile*>(dataFile);
+    if (mappedSlots == nullptr || mappedData == nullptr) return;
     uint32_t slots[kSkipMostSlots];
     uint32_t wantSlots = kSkipFirstSlots;
     uint32_t base = 0;  // the number of slots[0]
@@ -1066,12 +1071,12 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
     // Slots from number first on, as readSlot reads them.
     auto readSlots = [&](uint64_t first) -> bool {
         uint64_t position = first * kSlotSize;
-        if (position + static_cast<uint64_t>(wantSlots) * kSlotSize > 0x7FFFFFFFull ||
-            !pointerFile->seek(static_cast<long>(position), SEEK_FROM_START))
-            return false;
-        unsigned char bytes[kSkipMostSlots * kSlotSize];
-        uint32_t got = pointerFile->read(bytes, wantSlots * kSlotSize) / kSlotSize;
-        for (uint32_t i = 0; i < got; ++i) slots[i] = codec::decodeFixed32(reinterpret_cast<const char*>(bytes) + i * kSlotSize);
+        if (position + static_cast<uint64_t>(wantSlots) * kSlotSize > 0x7FFFFFFFull) return false;
+        uint32_t got = 0;
+        const char* bytes = mappedSlots->view(static_cast<uint32_t>(position), wantSlots * kSlotSize, &got);
+        if (bytes == nullptr) return false;
+        got /= kSlotSize;
+        for (uint32_t i = 0; i < got; ++i) slots[i] = codec::decodeFixed32(bytes + i * kSlotSize);
         base = static_cast<uint32_t>(first);
         haveSlots = got;
         slotsEnd = got < wantSlots;
@@ -1081,6 +1086,7 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
     if (id == 0xFFFFFFFFu || !readSlots(static_cast<uint64_t>(id) + 1)) return;
 
     uint32_t wantBytes = kSkipFirstBytes;
+    const unsigned char* window = nullptr;
     uint32_t windowStart = 0, windowHave = 0;
     bool windowEnd = false;  // the data file ends behind the window
     uint32_t n = base;
@@ -1111,15 +1117,14 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
         bool inWindow = offset >= windowStart && offset - windowStart <= windowHave;
         for (int attempt = 0; attempt < 2 && decoded == PeekDecode::NeedMore; ++attempt) {
             if (!inWindow) {
-                if (!dataFile->seek(static_cast<long>(offset), SEEK_FROM_START)) return;
-                if (skipBytes.size() < wantBytes) skipBytes.resize(wantBytes);
                 windowStart = offset;
-                windowHave = dataFile->read(skipBytes.data(), wantBytes);
+                window = reinterpret_cast<const unsigned char*>(mappedData->view(offset, wantBytes, &windowHave));
+                if (window == nullptr) return;
                 windowEnd = windowHave < wantBytes;
                 if (wantBytes < kSkipMostBytes) wantBytes *= 2;
             }
             uint32_t at = offset - windowStart;
-            decoded = decodePeeked(skipBytes.data() + at, windowHave - at, windowEnd, schema, &length);
+            decoded = decodePeeked(window + at, windowHave - at, windowEnd, schema, &length);
             if (decoded == PeekDecode::NeedMore) {
                 if (length > kSkipMostBytes) return;
                 while (wantBytes < length) wantBytes *= 2;
@@ -1127,7 +1132,7 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
             }
         }
         if (decoded != PeekDecode::Done) return;
-        const unsigned char* record = skipBytes.data() + (offset - windowStart);
+        const unsigned char* record = window + (offset - windowStart);
         uint32_t end = offset + length;
         if (nextKnown && slots[n + 1 - base] != kRemovedSlot && slots[n + 1 - base] != end) return;
         for (unsigned int k = 0; k < keys; ++k) {

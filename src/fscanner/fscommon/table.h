@@ -418,8 +418,6 @@ private:
     // The bucket of text's key: hash() of text upper-cased as wcsupper does,
     // without a copy of the text.
     int upperTextBucket(wchar_t const* text);
-    // skipRejected's copy of the records it looks at.
-    std::vector<unsigned char> skipBytes;
     // The last number peekedBucket hashed, and its bucket: the rows of one
     // directory follow each other and share their PATHID.
     uint32_t lastDecimal = 0;
