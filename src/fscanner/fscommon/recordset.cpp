@@ -44,7 +44,8 @@ __recordSet::__recordSet()
       evaluator(nullptr),
       nameFilter(nullptr),
       equalColumn(-1),
-      equalVariable(nullptr) {}
+      equalVariable(nullptr),
+      nameWanted(false) {}
 
 __recordSet::__recordSet(FS_Table* owner)
     : id(0),
@@ -60,7 +61,8 @@ __recordSet::__recordSet(FS_Table* owner)
       evaluator(nullptr),
       nameFilter(nullptr),
       equalColumn(-1),
-      equalVariable(nullptr) {}
+      equalVariable(nullptr),
+      nameWanted(false) {}
 
 __recordSet::~__recordSet() {
     kelm_free(key);
@@ -78,6 +80,7 @@ void __recordSet::forgetIndex() {
 bool __recordSet::setCriteria(CriteriaEvaluator* criteria, bool caseSensitive) {
     forgetIndex();
     nameFilter = nullptr;
+    nameWanted = false;
     equalColumn = -1;
     equalVariable = nullptr;
     evaluator = criteria;
@@ -143,13 +146,19 @@ bool __recordSet::rejectsName(void* context, const unsigned char* bytes, uint32_
 
 bool __recordSet::moveToCandidate() {
     // Rows whose name the byte test turns away are passed over in the
-    // table; the next one is read here.
-    if (nameFilter != nullptr) table->skipRejected(id, nameFilter->getColumn(), rejectsName, this);
-    return table->moveNext(id);
+    // table; the next one is read here, without a second look at its name
+    // when the table has just found it wanted.
+    unsigned int wanted = FS_Table::kNoRow;
+    if (nameFilter != nullptr) table->skipRejected(id, nameFilter->getColumn(), rejectsName, this, &wanted);
+    if (!table->moveNext(id)) return false;
+    nameWanted = wanted != FS_Table::kNoRow && id == wanted;
+    return true;
 }
 
 bool __recordSet::readAndDecide(bool* accepted) {
-    if (nameFilter != nullptr) {
+    bool known = nameWanted;
+    nameWanted = false;
+    if (nameFilter != nullptr && !known) {
         const unsigned char* text = nullptr;
         uint32_t length = 0;
         bool ascii = false;
@@ -177,6 +186,7 @@ bool __recordSet::moveFirst() {
             if (!table->hashIndex_moveNext(*index, id, nextSlot)) return false;
         }
     }
+    nameWanted = false;
     if (!table->moveFirst(id)) return false;
     for (;;) {
         bool accepted = false;

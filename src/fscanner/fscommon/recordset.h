@@ -137,6 +137,9 @@ private:
     // compared with.  The variable is not owned.
     int equalColumn;
     Field* equalVariable;
+    // The row moveToCandidate stands on passed the name filter's checks in
+    // the table: readAndDecide reads it without peeking again.
+    bool nameWanted;
 };
 
 class RecordSet {

@@ -1034,7 +1034,9 @@ const uint32_t kSkipMostBytes = 0x10000;
 
 }  // namespace
 
-void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject reject, void* context) {
+void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject reject, void* context,
+                            unsigned int* wanted) {
+    if (wanted != nullptr) *wanted = kNoRow;
     if (dataFile == nullptr || pointerFile == nullptr || guard == nullptr || reject == nullptr) return;
     // A row check needs the decoded record; a walk that does not stand at id
     // is for moveNext to end.
@@ -1142,7 +1144,11 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
             if (bucket >= 0 && !keyEntry[k]->holds(n, static_cast<uint32_t>(bucket))) return;
         }
         PeekedColumn& text = peekColumns[column];
-        if (!peekedAscii(text, record) || !reject(context, record + text.at, text.length)) return;
+        if (!peekedAscii(text, record)) return;
+        if (!reject(context, record + text.at, text.length)) {
+            if (wanted != nullptr) *wanted = n;
+            return;
+        }
         // Passed over: counted as moveNext counts a live slot.
         ++guard->walkLive;
         guard->walkAt = n;

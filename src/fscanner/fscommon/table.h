@@ -145,9 +145,14 @@ public:
     // read makes, the end of the pointer file) and leaves id at the last row
     // passed over: the walk goes on with moveNext and a full read of that
     // row, which note any damage.  Nothing is noted here.  Without the guard,
-    // or outside a walk, it passes over nothing.
+    // or outside a walk, it passes over nothing.  wanted, when given, is set
+    // to the number of the row it stopped in front of when that row passed
+    // every check of peekText, holds plain ASCII and was not turned away (a
+    // peekText of it would answer those bytes), and to kNoRow otherwise.
     typedef bool (*TextReject)(void* context, const unsigned char* bytes, uint32_t length);
-    void skipRejected(unsigned int& id, unsigned int column, TextReject reject, void* context);
+    static const unsigned int kNoRow = 0xFFFFFFFFu;
+    void skipRejected(unsigned int& id, unsigned int column, TextReject reject, void* context,
+                      unsigned int* wanted = nullptr);
     // Plain table: overwrites in place unless a text changes its character
     // count, in which case the record moves to a new number.  Compressed
     // table: always moves.  The new number is not reported.  A move whose
