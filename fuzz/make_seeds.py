@@ -119,6 +119,13 @@ put('table_fuzzer', 'compressed_chain',
     table_input(0x81 | (2 << 1), dat, pxx, lst, 65536, [(b0, 0, 65536), (65536, 2, 0xffffffff)]))
 dat, pxx = table(RECORDS[:2], False, nulls=0xff)
 put('table_fuzzer', 'plain_no_index', table_input(0x00, dat, pxx, b'', 0, []))
+# Enough rows of names of both parities for the filtered walks to pass some
+# over inside the table: with a sound index, and compressed with removals.
+MANY = [('n' + 'x' * (i % 7) + str(i), i * 13, i, i % 256, i * 7) for i in range(60)]
+dat, pxx = table(MANY, False)
+put('table_fuzzer', 'many_rows_indexed', table_input(0x80, dat, pxx, lst, 65536, key_patches(MANY)))
+dat, pxx = table(MANY, True, removed=(5, 17, 59))
+put('table_fuzzer', 'many_rows_compressed', table_input(0x01, dat, pxx, b'', 0, []))
 dat, pxx = table([(), ()], False, fields=[])
 put('table_fuzzer', 'no_fields', table_input(0x00, dat, pxx, index_list([(7, 'x', 'y')]), 0, []))
 dat, pxx = table([('x', 1)], False, fields=[('N', 5), ('H', 6)])
