@@ -150,7 +150,7 @@ public:
     // every check of peekText, holds plain ASCII and was not turned away (a
     // peekText of it would answer those bytes), and to kNoRow otherwise.
     typedef bool (*TextReject)(void* context, const unsigned char* bytes, uint32_t length);
-    static const unsigned int kNoRow = 0xFFFFFFFFu;
+    static constexpr unsigned int kNoRow = 0xFFFFFFFFu;
     void skipRejected(unsigned int& id, unsigned int column, TextReject reject, void* context,
                       unsigned int* wanted = nullptr);
     // Plain table: overwrites in place unless a text changes its character
@@ -412,11 +412,9 @@ private:
     // decodePeeked); false where only the full read can tell (text that is
     // not plain ASCII).
     bool peekedBucket(unsigned int column, const unsigned char* bytes, int* bucket);
-
-    // towupper of each ASCII code, for the index keys of peeked text and of
-    // inserted text; filled at the first use.
-    // Entries 0 and 128..255, which no plain ASCII text holds, are
-    // kNotPlainAscii.
+    // towupper of each ASCII code 1..127, for the index keys of peeked text
+    // and of inserted text; 0 and 128..255, which no plain ASCII text holds,
+    // have a mark no upper case has (kNotPlainAscii).  Filled at first use.
     uint32_t upperAscii[256];
     bool upperAsciiReady = false;
     const uint32_t* upperAsciiTable();
