@@ -876,8 +876,7 @@ public:
     // The quick form: a record that is only a path and a name.
     void print(const wchar_t* path, const wchar_t* name) {
         if (options.format == FORMAT_NULL || broken) return;
-        appendLocal(buffer, path);
-        if (path != nullptr && path[0] != L'\0' && path[wcslen(path) - 1] != L'/') buffer.push_back('/');
+        buffer += localDirectory(path);
         appendLocal(buffer, name);
         buffer.push_back(options.print0 ? '\0' : '\n');
         flushIfFull();
@@ -885,9 +884,7 @@ public:
 
     void print(FsFileInfo& info) {
         if (options.format == FORMAT_NULL || broken) return;
-        std::string full;
-        appendLocal(full, info.getPath());
-        if (!full.empty() && full.back() != '/') full.push_back('/');
+        std::string full = localDirectory(info.getPath());
         appendLocal(full, info.getName());
         bool regular = (info.getAttr() & FsFileInfo::ATTR_REGULAR) != 0;
         if (options.format == FORMAT_TEXT) {
@@ -950,6 +947,24 @@ public:
 
 private:
     static const size_t kHeldInMemory = 8u << 20;
+
+    // The local form of a directory's path with a separator behind it
+    // (nothing for an empty or absent path).  The hits of one directory
+    // come one after another: the last one converted is kept and given
+    // again while the path is the same.
+    const std::string& localDirectory(const wchar_t* path) {
+        if (path == nullptr || path[0] == L'\0') {
+            noDirectory.clear();
+            return noDirectory;
+        }
+        if (directoryKnown && std::wcscmp(path, directoryWide.c_str()) == 0) return directoryLocal;
+        directoryWide.assign(path);
+        directoryLocal.clear();
+        appendLocal(directoryLocal, path);
+        if (directoryLocal.back() != '/') directoryLocal.push_back('/');
+        directoryKnown = true;
+        return directoryLocal;
+    }
 
     static std::string narrow(const wchar_t* text) {
         std::string out;
@@ -1100,6 +1115,10 @@ private:
     std::string holdDirectory;
     std::string held;
     int heldFile = -1;
+    bool directoryKnown = false;
+    std::wstring directoryWide;
+    std::string directoryLocal;
+    std::string noDirectory;
 };
 
 // The writer the engine and the walk see: counts hits and prints them.
