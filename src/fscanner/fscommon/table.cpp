@@ -985,9 +985,7 @@ bool FS_Table::peekPassesGuard(unsigned int id, uint32_t end) {
     if (id != 0xFFFFFFFFu && readSlot(id + 1, &nextOffset) && nextOffset != kRemovedSlot && nextOffset != end)
         return false;
     for (TableGuard::IndexBuckets& entry : guard->indexes) {
-        bool current = false;
-        for (Index* index : indexes) current = current || index == entry.index;
-        if (!current) continue;
+        if (!isCurrent(entry.index)) continue;
         int column = peekGuardColumn(static_cast<size_t>(&entry - guard->indexes.data()));
         if (column < 0) continue;
         int bucket = -1;
@@ -1051,9 +1049,7 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
     unsigned int keys = 0;
     for (size_t k = 0; k < guard->indexes.size(); ++k) {
         TableGuard::IndexBuckets& entry = guard->indexes[k];
-        bool current = false;
-        for (Index* index : indexes) current = current || index == entry.index;
-        if (!current) continue;
+        if (!isCurrent(entry.index)) continue;
         int keyAt = peekGuardColumn(k);
         if (keyAt < 0) continue;
         if (!entry.whole || keys == kMostKeys) return;

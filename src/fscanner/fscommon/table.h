@@ -368,6 +368,9 @@ private:
     bool guardFiled(TableGuard::IndexBuckets& entry, unsigned int id, uint32_t bucket);
     // guardFiled for every current index, keys taken from record.
     bool guardKeys(unsigned int id, Fields& record);
+    // index is still one of the table's own: the guard's list keeps entries
+    // of indexes dropped since, compared only.
+    bool isCurrent(Index const* index) const;
     // A walk starts at slot 0 (firstOffset its slot), passes a live slot,
     // and reaches the end of the pointer file.
     void guardWalkStart(uint32_t firstOffset);

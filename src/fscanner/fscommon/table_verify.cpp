@@ -492,11 +492,15 @@ bool FS_Table::guardFiled(TableGuard::IndexBuckets& entry, unsigned int id, uint
     }
 }
 
+bool FS_Table::isCurrent(Index const* index) const {
+    for (Index* mine : indexes)
+        if (mine == index) return true;
+    return false;
+}
+
 bool FS_Table::guardKeys(unsigned int id, Fields& record) {
     for (TableGuard::IndexBuckets& entry : guard->indexes) {
-        bool current = false;
-        for (Index* index : indexes) current = current || index == entry.index;
-        if (!current) continue;
+        if (!isCurrent(entry.index)) continue;
         int bucket = keyBucket(record.name(entry.field.c_str()));
         if (bucket >= 0 && !guardFiled(entry, id, static_cast<uint32_t>(bucket))) return false;
     }
