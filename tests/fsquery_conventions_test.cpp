@@ -333,6 +333,84 @@ TEST_F(FsQueryConventions, NothingIsPrintedBeforeTheCacheTurnsOutUnusable) {
     EXPECT_EQ(43u, next.lines().size());
 }
 
+// The same with an answer of many output buffers, which wait in memory one
+// after the other: none of them is printed, and a served answer gives every
+// line once, in the order of a second served run.
+TEST_F(FsQueryConventions, NothingOfALongAnswerIsPrintedBeforeTheCacheTurnsOutUnusable) {
+    const std::string padding(80, 'p');
+    for (int i = 0; i < 3000; ++i) dir.write("tree/many/" + padding + std::to_string(i), "");
+    ToolRun built = query({tree});
+    ASSERT_EQ(0, built.status) << built.err;
+    ASSERT_GT(built.out.size(), 4u << 16) << "the answer must span several output buffers";
+    ToolRun served = query({tree});
+    ASSERT_EQ(0, served.status) << served.err;
+    EXPECT_EQ(built.out, served.out);
+    // The cache keeps the rows in the order the walk met them, the order in
+    // which a walk without the cache prints them.
+    EXPECT_EQ(direct({tree}).out, served.out);
+    EXPECT_EQ(3003u, served.lines().size());
+    EXPECT_EQ(3003u, served.lineSet().size());
+
+    std::string pointers = cache + "/all/files.pxx";
+    std::string slots = testsupport::readFile(pointers);
+    size_t last = slots.size() / 4;
+    uint32_t offset = 0;
+    while (last > 1) {
+        --last;
+        std::memcpy(&offset, slots.data() + last * 4, 4);
+        if (offset != 0) break;
+    }
+    ASSERT_NE(0u, offset);
+    offset += 1;
+    std::memcpy(&slots[last * 4], &offset, 4);
+    std::ofstream(pointers, std::ios::binary | std::ios::trunc) << slots;
+    ToolRun r = query({tree});
+    EXPECT_EQ(3, r.status) << r.err;
+    EXPECT_EQ("", r.out);
+    EXPECT_TRUE(contains(r.err, "cache unusable (-40)")) << r.err;
+}
+
+// An answer larger than the 8 MiB it may wait in memory goes on waiting in a
+// file: printed whole and in order once the query succeeds, not at all when
+// it fails.
+TEST_F(FsQueryConventions, AnAnswerPastItsMemoryWaitsInAFileAndIsPrintedWhole) {
+    // Lines of some 2,900 bytes: a few thousand files make the size.
+    std::string deep = "tree";
+    for (int level = 0; level < 14; ++level) deep += "/" + std::string(200, 'd') + std::to_string(level);
+    dir.mkdirs(deep);
+    const int files = 3200;
+    for (int i = 0; i < files; ++i) {
+        int fd = ::open(dir.file(deep + "/f" + std::to_string(i)).c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+        ASSERT_GE(fd, 0);
+        ::close(fd);
+    }
+    ToolRun built = query({tree});
+    ASSERT_EQ(0, built.status) << built.err;
+    ASSERT_GT(built.out.size(), static_cast<size_t>(8u << 20)) << "the answer must outgrow the memory it waits in";
+    EXPECT_EQ(static_cast<size_t>(files) + 3, built.lines().size());  // and the fixture's three
+    EXPECT_EQ(direct({tree}).out, built.out);
+    ToolRun served = query({tree});
+    ASSERT_EQ(0, served.status) << served.err;
+    EXPECT_EQ(built.out, served.out);
+
+    std::string pointers = cache + "/all/files.pxx";
+    std::string slots = testsupport::readFile(pointers);
+    size_t last = slots.size() / 4;
+    uint32_t offset = 0;
+    while (last > 1) {
+        --last;
+        std::memcpy(&offset, slots.data() + last * 4, 4);
+        if (offset != 0) break;
+    }
+    ASSERT_NE(0u, offset);
+    offset += 1;
+    std::memcpy(&slots[last * 4], &offset, 4);
+    std::ofstream(pointers, std::ios::binary | std::ios::trunc) << slots;
+    ToolRun r = query({tree});
+    EXPECT_EQ(3, r.status) << r.err;
+    EXPECT_EQ("", r.out);
+}
+
 TEST_F(FsQueryConventions, BadOperandOfAnExpressionIsNamed) {
     ToolRun r = query({"-e", "[SIZE]>abc", tree});
     EXPECT_EQ(2, r.status);

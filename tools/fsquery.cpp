@@ -859,7 +859,7 @@ private:
 class Printer {
 public:
     Printer(const Options& o, Progress& p) : options(o), progress(p) {
-        buffer.reserve(1 << 16);
+        buffer.reserve(kBufferBytes);
     }
     ~Printer() {
         if (heldFile >= 0) ::close(heldFile);
@@ -925,13 +925,15 @@ public:
             ::close(heldFile);
             heldFile = -1;
         }
-        write(held.data(), held.size());
+        for (const std::string& chunk : held) write(chunk.data(), chunk.size());
         held.clear();
+        heldSize = 0;
     }
     // Drops what waited and ends the holding.
     void discard() {
         buffer.clear();
         held.clear();
+        heldSize = 0;
         if (heldFile >= 0) ::close(heldFile);
         heldFile = -1;
         holding = false;
@@ -947,6 +949,7 @@ public:
 
 private:
     static const size_t kHeldInMemory = 8u << 20;
+    static const size_t kBufferBytes = 1u << 16;
 
     // The local form of a directory's path with a separator behind it
     // (nothing for an empty or absent path).  The hits of one directory
@@ -1058,12 +1061,15 @@ private:
     }
 
     void flushIfFull() {
-        if (buffer.size() >= (1 << 16) - 4096) flush();
+        if (buffer.size() >= kBufferBytes - 4096) flush();
     }
     void flush() {
         if (buffer.empty()) return;
-        if (holding) keep(buffer);
-        else write(buffer.data(), buffer.size());
+        if (holding) {
+            keep(buffer);
+        } else {
+            write(buffer.data(), buffer.size());
+        }
         buffer.clear();
     }
     void write(const char* data, size_t size) {
@@ -1072,17 +1078,28 @@ private:
         if (std::fwrite(data, 1, size, stdout) != size) broken = (errno == EPIPE) ? 1 : 2;
     }
     // Output that waits: in memory, and past kHeldInMemory in the file.
-    void keep(const std::string& text) {
-        if (heldFile < 0 && held.size() + text.size() > kHeldInMemory) {
+    // In memory it waits as the buffers it came in, each taken over whole:
+    // one string grown by doubling would copy all of it again at every
+    // doubling and touch twice its size in new pages.
+    void keep(std::string& text) {
+        if (heldFile < 0 && heldSize + text.size() > kHeldInMemory) {
             heldFile = openHeldFile();
-            if (heldFile >= 0 && !writeAll(heldFile, held)) {
+            bool copied = heldFile >= 0;
+            for (size_t i = 0; copied && i < held.size(); ++i) copied = writeAll(heldFile, held[i]);
+            if (heldFile >= 0 && !copied) {
                 ::close(heldFile);
                 heldFile = -1;
             }
-            if (heldFile >= 0) held.clear();
+            if (heldFile >= 0) {
+                held.clear();
+                heldSize = 0;
+            }
         }
         if (heldFile >= 0 && writeAll(heldFile, text)) return;
-        held += text;
+        heldSize += text.size();
+        held.push_back(std::move(text));
+        text = std::string();
+        text.reserve(kBufferBytes);
     }
     int openHeldFile() const {
 #ifdef O_TMPFILE
@@ -1113,7 +1130,8 @@ private:
     int broken = 0;  // 0 fine, 1 pipe closed, 2 write error
     bool holding = false;
     std::string holdDirectory;
-    std::string held;
+    std::vector<std::string> held;
+    size_t heldSize = 0;
     int heldFile = -1;
     bool directoryKnown = false;
     std::wstring directoryWide;
