@@ -9,6 +9,7 @@
 // cache then; every run, caught or not, must leave the directory clean.
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <sys/types.h>
 #include <sys/wait.h>
@@ -65,10 +66,23 @@ void sleepMilliseconds(long ms) {
     nanosleep(&t, nullptr);
 }
 
+// Waits up to `seconds` for the child to end; a child still there then is
+// killed outright and reported as hanging (false).
+bool waitBounded(pid_t pid, int* status, long seconds) {
+    for (long waited = 0; waited < seconds * 1000; waited += 5) {
+        if (waitpid(pid, status, WNOHANG) == pid) return true;
+        sleepMilliseconds(5);
+    }
+    ::kill(pid, SIGKILL);
+    waitpid(pid, status, 0);
+    return false;
+}
+
 struct KilledRun {
     bool exited = false;    // the tool ended before it could be killed
     int signal = 0;         // the signal that ended it
     bool caught = false;    // the kill came while the sort ran
+    bool hung = false;      // the tool did not end after the kill
 };
 
 // Starts the tool with --sort on the tree, waits for its trace to show the
@@ -129,8 +143,8 @@ KilledRun killDuringSort(const testsupport::TempDir& dir, const std::string& tre
         }
         sleepMilliseconds(1);
     }
-    if (!run.exited) waitpid(pid, &status, 0);
-    if (WIFSIGNALED(status)) run.signal = WTERMSIG(status);
+    if (!run.exited) run.hung = !waitBounded(pid, &status, 120);
+    if (WIFSIGNALED(status) && !run.hung) run.signal = WTERMSIG(status);
     run.caught = !run.exited &&
                  testsupport::readFile(trace).find("FsResultSetReader_OnFile::sort - file sorted!") == std::string::npos;
     return run;
@@ -155,6 +169,7 @@ TEST(FsQuerySortKill, TwoHundredThousandFilesKilledDuringTheSortLeaveNoTemporary
             std::string where = "signal " + std::to_string(signal) + ", attempt " + std::to_string(attempt);
             ASSERT_FALSE(run.exited) << "the tool ended before its sort began (" << where << "):\n"
                                      << testsupport::readFile(trace);
+            ASSERT_FALSE(run.hung) << "the tool did not end after the kill (" << where << ")";
             EXPECT_EQ(signal, run.signal) << where;
             EXPECT_EQ(std::vector<std::string>{}, leftovers(cache)) << where;
             EXPECT_EQ(std::vector<std::string>{}, leftovers(dir.file("tmp"))) << where;
@@ -162,6 +177,69 @@ TEST(FsQuerySortKill, TwoHundredThousandFilesKilledDuringTheSortLeaveNoTemporary
         }
         EXPECT_EQ(1, caught) << "no kill with signal " << signal << " came while the sort ran";
     }
+}
+
+// A kill that comes while the tool waits to write a trace line, under the
+// trace lock: the cleanup the signal runs traces too, and must not wait for
+// that lock on the same thread.  The trace goes to a pipe nobody reads, so
+// the tool stops inside a trace write once the pipe is full; the result file
+// of its sort exists by then.
+TEST(FsQuerySortKill, AKillWhileATraceLineWaitsEndsTheToolAndLeavesNoTemporaryFile) {
+    Workspace space;
+    const testsupport::TempDir& dir = space.dir;
+    std::string tree = space.file("tree");
+    makeTree(tree, 300, 5);
+    std::string mtab = dir.write("mtab", "/dev/vda / ext4 rw 0 0\n");
+    std::string cache = space.file("cache");
+    dir.mkdirs("tmp");
+    std::string fifo = dir.file("trace.fifo");
+    ASSERT_EQ(0, ::mkfifo(fifo.c_str(), 0600));
+    int reader = ::open(fifo.c_str(), O_RDONLY | O_NONBLOCK);
+    ASSERT_GE(reader, 0);
+    pid_t pid = fork();
+    if (pid == 0) {
+        int null = ::open("/dev/null", O_RDWR);
+        dup2(null, 0);
+        dup2(null, 1);
+        dup2(null, 2);
+        ::close(reader);
+        setenv("HOME", dir.file("home").c_str(), 1);
+        setenv("XDG_CACHE_HOME", dir.file("xdg").c_str(), 1);
+        setenv("TMPDIR", dir.file("tmp").c_str(), 1);
+        unsetenv("FSCANNER_TRACE_LEVEL");
+        unsetenv("FSCANNER_TRACE_FILE");
+        unsetenv("FSCANNER_CONFIG");
+        testsupport::execBuildProgram({kTool, "--mount-table", mtab, "--cache", cache, "--trace", fifo,
+                                       "--trace-level", "3", "--sort", "name", tree});
+        _exit(98);
+    }
+    ASSERT_GT(pid, 0);
+    // Full: what the pipe holds stops growing while the tool lives.
+    int status = 0;
+    bool ended = false;
+    int held = -1, still = 0;
+    for (long waited = 0; waited < 60000 && still < 60; waited += 5) {
+        if (waitpid(pid, &status, WNOHANG) == pid) {
+            ended = true;
+            break;
+        }
+        int now = 0;
+        ASSERT_EQ(0, ::ioctl(reader, FIONREAD, &now));
+        still = (now > 0 && now == held) ? still + 1 : 0;
+        held = now;
+        sleepMilliseconds(5);
+    }
+    ASSERT_FALSE(ended) << "the tool ended before its trace filled the pipe";
+    ASSERT_GE(held, 4096) << "the trace never filled the pipe";
+    EXPECT_FALSE(leftovers(cache).empty()) << "no result file while the tool waits";
+    ::kill(pid, SIGTERM);
+    bool endedAfterKill = waitBounded(pid, &status, 20);
+    ::close(reader);
+    ASSERT_TRUE(endedAfterKill) << "the tool hangs in its signal handler";
+    ASSERT_TRUE(WIFSIGNALED(status));
+    EXPECT_EQ(SIGTERM, WTERMSIG(status));
+    EXPECT_EQ(std::vector<std::string>{}, leftovers(cache));
+    EXPECT_EQ(std::vector<std::string>{}, leftovers(dir.file("tmp")));
 }
 
 }  // namespace

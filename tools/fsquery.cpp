@@ -1226,9 +1226,12 @@ char* tempNameInCache(char*) {
 // engine's own update flag tells the next run that this one did not finish.
 // Installed with SA_RESETHAND and SA_NODEFER: the signal's own action is
 // back in place on entry, so the raise ends the process, and so does a
-// second signal should a handler never return (a trace lock held by the code
-// the signal interrupted).
+// second signal should a handler never return.
 void onTerminate(int signal) {
+    // The cleanup handlers trace; the code this signal interrupted may be
+    // writing a trace line under the trace lock, which the handler would
+    // then wait for on this same thread.  The process is ending: no traces.
+    QvLogWrapper::silenceForSignal();
     FsResourceManager::getInstance()->invokeCleanupHandlers(signal);
     raise(signal);
 }

@@ -5,6 +5,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <cwchar>
+#include <atomic>
 #include <mutex>
 
 #include "base/KelCfg.h"
@@ -251,7 +252,16 @@ int QvLogWrapper::level() {
     return impl_->level;
 }
 
+namespace {
+// Set by silenceForSignal; read before any lock is taken.
+std::atomic<bool> gSilenced(false);
+static_assert(std::atomic<bool>::is_always_lock_free, "a signal handler sets it");
+}  // namespace
+
+void QvLogWrapper::silenceForSignal() { gSilenced.store(true, std::memory_order_relaxed); }
+
 bool QvLogWrapper::istraceActive(int level) {
+    if (gSilenced.load(std::memory_order_relaxed)) return false;
     std::lock_guard<std::mutex> g(impl_->lock);
     impl_->configureFromEnvironment();
     if (level <= LEVEL_OFF) return false;
@@ -280,7 +290,7 @@ std::vector<QvLogWrapper::Message> QvLogWrapper::captured() {
 
 void QvLogWrapper::emit(int level, int line, const char* file, const char* function,
                         const char* fmt, va_list args) {
-    if (!istraceActive(level)) return;
+    if (gSilenced.load(std::memory_order_relaxed) || !istraceActive(level)) return;
     std::string text = formatArgs(fmt, args);
     std::lock_guard<std::mutex> g(impl_->lock);
     if (impl_->capturing && level <= impl_->captureLevel) impl_->messages.push_back({level, text});

@@ -63,6 +63,14 @@ public:
     QvLogWrapper(const QvLogWrapper&) = delete;
     QvLogWrapper& operator=(const QvLogWrapper&) = delete;
 
+    // Ends all tracing of the process, for good: every trace operation
+    // returns at once from then on, without taking the lock or memory.  For
+    // a signal handler that runs cleanup code before the process ends: the
+    // code it interrupted may hold the trace lock (writing a line) or be
+    // inside the allocator, and a trace in the handler would wait for ever.
+    // Async-signal-safe.
+    static void silenceForSignal();
+
     // Formats like vsnprintf, with %S and %ls written as UTF-8.  Exposed for
     // tests of the formatter.
     static std::string format(const char* format, ...) __attribute__((format(printf, 1, 2)));
