@@ -165,6 +165,19 @@ std::wstring toWide(const std::string& text) {
 // holds; a character the locale cannot write becomes "?".
 void appendLocal(std::string& out, const wchar_t* text) {
     if (text == nullptr) return;
+    // The whole of most texts is ASCII: found so in one pass over the text,
+    // and narrowed in another, both simple enough to run many characters a
+    // step.
+    size_t length = std::wcslen(text);
+    uint32_t marks = 0;
+    for (size_t i = 0; i < length; ++i) marks |= static_cast<uint32_t>(text[i]);
+    if (marks < 0x80) {
+        size_t at = out.size();
+        out.resize(at + length);
+        char* to = &out[at];
+        for (size_t i = 0; i < length; ++i) to[i] = static_cast<char>(text[i]);
+        return;
+    }
     char buffer[MB_LEN_MAX];
     std::mbstate_t state = std::mbstate_t();
     for (; *text != L'\0'; ++text) {
