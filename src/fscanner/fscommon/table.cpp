@@ -1051,9 +1051,12 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
     if (count == 0 || count > kMaxFields || column >= count || schema.at(column)->getType() != FIELD_TEXT) return;
     // The key checks of peekPassesGuard, each answered by a whole index:
     // an index not yet checked whole is for the reads to check.
+    // The buckets are found as peekedBucket finds them, the column's kind
+    // looked up once here instead of at every row.
     const unsigned int kMostKeys = 16;
     TableGuard::IndexBuckets* keyEntry[kMostKeys];
     unsigned int keyColumn[kMostKeys];
+    bool keyText[kMostKeys];
     unsigned int keys = 0;
     for (size_t k = 0; k < guard->indexes.size(); ++k) {
         TableGuard::IndexBuckets& entry = guard->indexes[k];
@@ -1061,9 +1064,14 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
         int keyAt = peekGuardColumn(k);
         if (keyAt < 0) continue;
         if (!entry.whole || keys == kMostKeys) return;
+        unsigned int type = schema.at(static_cast<unsigned int>(keyAt))->getType();
+        // peekedBucket answers no other column: every row would stop here.
+        if (type != FIELD_TEXT && (type < FIELD_INT8 || type > FIELD_INT64)) return;
         keyEntry[keys] = &entry;
+        keyText[keys] = type == FIELD_TEXT;
         keyColumn[keys++] = static_cast<unsigned int>(keyAt);
     }
+    const uint32_t* upper = upperAsciiTable();
 
     // The table's files are mapped and lend their bytes in place.
     LinuxMmFile* mappedSlots = dynamic_cast<LinuxMmFile*>(pointerFile);
@@ -1142,10 +1150,25 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
         uint32_t end = offset + length;
         if (nextKnown && slots[n + 1 - base] != kRemovedSlot && slots[n + 1 - base] != end) return;
         for (unsigned int k = 0; k < keys; ++k) {
-            int bucket = -1;
             if (guard->reachedIndex == keyEntry[k]->index && guard->reachedId == n) return;
-            if (!peekedBucket(keyColumn[k], record, &bucket)) return;
-            if (bucket >= 0 && !keyEntry[k]->holds(n, static_cast<uint32_t>(bucket))) return;
+            PeekedColumn& key = peekColumns[keyColumn[k]];
+            int bucket;
+            if (keyText[k]) {
+                if (key.ascii == 0) return;
+                bool plain = false;
+                bucket = hashUpperAscii(record + key.at, key.length, upper, &plain);
+                key.ascii = plain ? 1 : 0;
+                if (!plain) return;
+            } else {
+                // Keyed by the low 32 bits, as the index writes it.
+                uint32_t number = static_cast<uint32_t>(key.number);
+                if (lastDecimalBucket < 0 || number != lastDecimal) {
+                    lastDecimal = number;
+                    lastDecimalBucket = hashDecimal(number);
+                }
+                bucket = lastDecimalBucket;
+            }
+            if (!keyEntry[k]->holds(n, static_cast<uint32_t>(bucket))) return;
         }
         PeekedColumn& text = peekColumns[column];
         if (!peekedAscii(text, record)) return;
