@@ -169,6 +169,59 @@ TEST_F(NameMaskTest, FilterNeverTurnsAwayARowTheEvaluatorAccepts)
     EXPECT_GT(turnedAway, 500);
 }
 
+// A cursor takes the byte test's answer as the verdict where decidesAscii()
+// says so, and evaluates no further: on every plain ASCII name the two must
+// agree both ways, and any expression beside the mask must be evaluated.
+TEST_F(NameMaskTest, ALoneMaskComparisonIsDecidedByTheByteTestAlone)
+{
+    int decided = 0, accepted = 0;
+    for (const std::wstring& mask : masks()) {
+        if (mask.find(L'"') != std::wstring::npos) continue;
+        std::wstring text = L"[FILENAME]==\"" + mask + L"\"";
+        for (bool caseSensitive : {true, false}) {
+            Row row;
+            row.set(L"first", 5);
+            CriteriaEvaluator evaluator(text.c_str());
+            ASSERT_TRUE(evaluator.setFields(&row.fields));
+            evaluator.getHashInfo();
+            NameMaskFilter const* filter = evaluator.getNameFilter(&row.fields);
+            if (!ascii(mask)) {
+                EXPECT_TRUE(filter == nullptr || !filter->decidesAscii());
+                continue;
+            }
+            ASSERT_NE(nullptr, filter) << std::string(text.begin(), text.end());
+            ASSERT_TRUE(filter->decidesAscii()) << std::string(text.begin(), text.end());
+            for (const std::wstring& name : names()) {
+                if (!ascii(name)) continue;
+                row.set(name, 5);
+                bool verdict = evaluator.check(&row.fields, nullptr, caseSensitive) > 0;
+                std::string bytes = utf8(name);
+                bool may = filter->mayMatchAscii(reinterpret_cast<const unsigned char*>(bytes.data()),
+                                                 bytes.size(), caseSensitive);
+                EXPECT_EQ(verdict, may) << "'" << std::string(text.begin(), text.end()) << "' on '" << bytes
+                                        << "' case " << caseSensitive;
+                ++decided;
+                if (verdict) ++accepted;
+            }
+        }
+    }
+    EXPECT_GT(decided, 1000);
+    EXPECT_GT(accepted, 100);
+    const wchar_t* const evaluated[] = {
+        L"[FILENAME]==\"*.c\" || [FILENAME]==\"*.md\"", L"[SIZE]>1000 && [FILENAME]==\"*.c\"",
+        L"[FILENAME]==\"*.c\" && [SIZE]>=0",           L"[FILENAME]==\"*.c\" || [SIZE]==3",
+    };
+    for (const wchar_t* text : evaluated) {
+        Row row;
+        CriteriaEvaluator evaluator(text);
+        ASSERT_TRUE(evaluator.setFields(&row.fields));
+        evaluator.getHashInfo();
+        NameMaskFilter const* filter = evaluator.getNameFilter(&row.fields);
+        ASSERT_NE(nullptr, filter);
+        EXPECT_FALSE(filter->decidesAscii()) << std::wstring(text).size();
+    }
+}
+
 TEST_F(NameMaskTest, FilterExistsOnlyWhereATurnedAwayRowWouldHaveBeenQuiet)
 {
     Row row;

@@ -50,6 +50,10 @@ public:
     bool mayMatch(const unsigned char* text, size_t length, bool caseSensitive) const;
     // The same for a text known to be plain ASCII.
     bool mayMatchAscii(const unsigned char* text, size_t length, bool caseSensitive) const;
+    // True when the expression is the one mask comparison: on a plain ASCII
+    // text the byte matcher answers as the evaluator does, so mayMatchAscii
+    // is then the expression's verdict, not only a bound on it.
+    bool decidesAscii() const { return root >= 0 && nodes[static_cast<size_t>(root)].kind == MASK; }
 
 private:
     enum Kind { AND, OR, MASK, PURE, OTHER };

@@ -156,20 +156,25 @@ bool __recordSet::moveToCandidate() {
 }
 
 bool __recordSet::readAndDecide(bool* accepted) {
-    bool known = nameWanted;
+    // wanted: the name is plain ASCII and the byte test let it through.
+    bool wanted = nameWanted;
     nameWanted = false;
-    if (nameFilter != nullptr && !known) {
+    if (nameFilter != nullptr && !wanted) {
         const unsigned char* text = nullptr;
         uint32_t length = 0;
         bool ascii = false;
-        if (table->peekText(id, nameFilter->getColumn(), &text, &length, &ascii) && ascii &&
-            !nameFilter->mayMatchAscii(text, length, caseFlag)) {
-            *accepted = false;
-            return true;
+        if (table->peekText(id, nameFilter->getColumn(), &text, &length, &ascii) && ascii) {
+            if (!nameFilter->mayMatchAscii(text, length, caseFlag)) {
+                *accepted = false;
+                return true;
+            }
+            wanted = true;
         }
     }
     if (!read()) return false;
-    *accepted = fits();
+    // Criteria that are the one mask comparison were decided by the byte
+    // test on that name: the row is read for its values, not evaluated again.
+    *accepted = (wanted && nameFilter->decidesAscii()) || fits();
     return true;
 }
 
