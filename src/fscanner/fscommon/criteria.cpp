@@ -119,19 +119,7 @@ NameMaskFilter::Outcome NameMaskFilter::evaluate(int index, const unsigned char*
             return (left == FALSE_QUIET && right == FALSE_QUIET) ? FALSE_QUIET : QUIET;
         }
         case MASK:
-            if (n.suffixOnly) {
-                // The matcher tries the tail at every start in turn and takes
-                // one that ends with the text: a suffix test.
-                size_t tail = n.mask.size() - 1;
-                if (length < tail) return FALSE_QUIET;
-                const unsigned char* p = reinterpret_cast<const unsigned char*>(n.mask.data()) + 1;
-                const unsigned char* t = text + (length - tail);
-                for (size_t i = 0; i < tail; ++i) {
-                    bool same = caseSensitive ? p[i] == t[i] : fold.lower[p[i]] == fold.lower[t[i]];
-                    if (!same) return FALSE_QUIET;
-                }
-                return QUIET;
-            }
+            if (n.suffixOnly) return endsWithTail(n, text, length, caseSensitive) ? QUIET : FALSE_QUIET;
             // A plain mask is compared whole by the evaluator; the glob of a
             // mask without "*" and "?" is that same comparison.
             return asciiWildvccmp(reinterpret_cast<const unsigned char*>(n.mask.c_str()), text, length,
@@ -150,8 +138,27 @@ bool NameMaskFilter::mayMatch(const unsigned char* text, size_t length, bool cas
     return mayMatchAscii(text, length, caseSensitive);
 }
 
+bool NameMaskFilter::endsWithTail(Node const& n, const unsigned char* text, size_t length,
+                                  bool caseSensitive) const {
+    // The matcher tries the tail at every start in turn and takes one that
+    // ends with the text: a suffix test.
+    size_t tail = n.mask.size() - 1;
+    if (length < tail) return false;
+    const unsigned char* p = reinterpret_cast<const unsigned char*>(n.mask.data()) + 1;
+    const unsigned char* t = text + (length - tail);
+    for (size_t i = 0; i < tail; ++i) {
+        bool same = caseSensitive ? p[i] == t[i] : fold.lower[p[i]] == fold.lower[t[i]];
+        if (!same) return false;
+    }
+    return true;
+}
+
 bool NameMaskFilter::mayMatchAscii(const unsigned char* text, size_t length, bool caseSensitive) const {
     if (root < 0 || text == nullptr) return true;
+    // The usual query, "*.ext" alone, without the walk over the nodes: it
+    // runs once for every row of a table.
+    Node const& top = nodes[static_cast<size_t>(root)];
+    if (top.kind == MASK && top.suffixOnly) return endsWithTail(top, text, length, caseSensitive);
     return evaluate(root, text, length, caseSensitive) != FALSE_QUIET;
 }
 

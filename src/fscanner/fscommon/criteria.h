@@ -71,6 +71,8 @@ private:
     };
     int add(TreeNode* node, Fields* fields, unsigned int depth);
     Outcome evaluate(int node, const unsigned char* text, size_t length, bool caseSensitive) const;
+    // A suffixOnly MASK's answer: whether the text ends in the mask's tail.
+    bool endsWithTail(Node const& n, const unsigned char* text, size_t length, bool caseSensitive) const;
 
     std::vector<Node> nodes;
     int root = -1;
