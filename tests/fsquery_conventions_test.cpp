@@ -304,11 +304,9 @@ TEST_F(FsQueryConventions, StatsNeverShowNegativeCounts) {
     EXPECT_FALSE(std::regex_search(walked.err, std::regex(": -[0-9]"))) << walked.err;
 }
 
-TEST_F(FsQueryConventions, NothingIsPrintedBeforeTheCacheTurnsOutUnusable) {
-    for (int i = 0; i < 40; ++i) dir.write("tree/many/f" + std::to_string(i), std::to_string(i));
-    ASSERT_EQ(0, query({tree}).status);
-    // The last file row's slot points one byte past where its record
-    // begins: the damage shows when that row is read, after the others.
+// The last file row's slot points one byte past where its record begins:
+// the damage shows when that row is read, after the others.
+void pointLastFileRowPastItsStart(const std::string& cache) {
     std::string pointers = cache + "/all/files.pxx";
     std::string slots = testsupport::readFile(pointers);
     ASSERT_GE(slots.size(), 8u);
@@ -323,6 +321,12 @@ TEST_F(FsQueryConventions, NothingIsPrintedBeforeTheCacheTurnsOutUnusable) {
     offset += 1;
     std::memcpy(&slots[last * 4], &offset, 4);
     std::ofstream(pointers, std::ios::binary | std::ios::trunc) << slots;
+}
+
+TEST_F(FsQueryConventions, NothingIsPrintedBeforeTheCacheTurnsOutUnusable) {
+    for (int i = 0; i < 40; ++i) dir.write("tree/many/f" + std::to_string(i), std::to_string(i));
+    ASSERT_EQ(0, query({tree}).status);
+    ASSERT_NO_FATAL_FAILURE(pointLastFileRowPastItsStart(cache));
     ToolRun r = query({tree});
     EXPECT_EQ(3, r.status) << r.err;
     EXPECT_EQ("", r.out);
@@ -351,19 +355,7 @@ TEST_F(FsQueryConventions, NothingOfALongAnswerIsPrintedBeforeTheCacheTurnsOutUn
     EXPECT_EQ(3003u, served.lines().size());
     EXPECT_EQ(3003u, served.lineSet().size());
 
-    std::string pointers = cache + "/all/files.pxx";
-    std::string slots = testsupport::readFile(pointers);
-    size_t last = slots.size() / 4;
-    uint32_t offset = 0;
-    while (last > 1) {
-        --last;
-        std::memcpy(&offset, slots.data() + last * 4, 4);
-        if (offset != 0) break;
-    }
-    ASSERT_NE(0u, offset);
-    offset += 1;
-    std::memcpy(&slots[last * 4], &offset, 4);
-    std::ofstream(pointers, std::ios::binary | std::ios::trunc) << slots;
+    ASSERT_NO_FATAL_FAILURE(pointLastFileRowPastItsStart(cache));
     ToolRun r = query({tree});
     EXPECT_EQ(3, r.status) << r.err;
     EXPECT_EQ("", r.out);
@@ -393,19 +385,7 @@ TEST_F(FsQueryConventions, AnAnswerPastItsMemoryWaitsInAFileAndIsPrintedWhole) {
     ASSERT_EQ(0, served.status) << served.err;
     EXPECT_EQ(built.out, served.out);
 
-    std::string pointers = cache + "/all/files.pxx";
-    std::string slots = testsupport::readFile(pointers);
-    size_t last = slots.size() / 4;
-    uint32_t offset = 0;
-    while (last > 1) {
-        --last;
-        std::memcpy(&offset, slots.data() + last * 4, 4);
-        if (offset != 0) break;
-    }
-    ASSERT_NE(0u, offset);
-    offset += 1;
-    std::memcpy(&slots[last * 4], &offset, 4);
-    std::ofstream(pointers, std::ios::binary | std::ios::trunc) << slots;
+    ASSERT_NO_FATAL_FAILURE(pointLastFileRowPastItsStart(cache));
     ToolRun r = query({tree});
     EXPECT_EQ(3, r.status) << r.err;
     EXPECT_EQ("", r.out);
