@@ -85,8 +85,6 @@ struct KilledRun {
     bool hung = false;      // the tool did not end after the kill
 };
 
-// Starts the tool with --sort on the tree, waits for its trace to show the
-// sort starting, sends it `signal` and waits for it.
 // Where the tree and the cache go: a memory file system when the machine has
 // one (200,000 files made and removed there cost little, and leave the
 // disk's inode allocator alone), else the test's own directory.
@@ -110,15 +108,19 @@ private:
     std::string fast;
 };
 
-KilledRun killDuringSort(const testsupport::TempDir& dir, const std::string& tree, const std::string& mtab,
-                         const std::string& cache, const std::string& trace, int signal) {
-    ::unlink(trace.c_str());
+// Starts the tool with --sort on the tree, tracing at traceLevel into
+// trace, its standard streams on /dev/null and its home, cache and
+// temporary directories in dir; closeInChild (or -1) is a descriptor the
+// tool must not hold.
+pid_t startSort(const testsupport::TempDir& dir, const std::string& tree, const std::string& mtab,
+                const std::string& cache, const std::string& trace, const char* traceLevel, int closeInChild) {
     pid_t pid = fork();
     if (pid == 0) {
         int null = ::open("/dev/null", O_RDWR);
         dup2(null, 0);
         dup2(null, 1);
         dup2(null, 2);
+        if (closeInChild >= 0) ::close(closeInChild);
         setenv("HOME", dir.file("home").c_str(), 1);
         setenv("XDG_CACHE_HOME", dir.file("xdg").c_str(), 1);
         setenv("TMPDIR", dir.file("tmp").c_str(), 1);
@@ -126,9 +128,18 @@ KilledRun killDuringSort(const testsupport::TempDir& dir, const std::string& tre
         unsetenv("FSCANNER_TRACE_FILE");
         unsetenv("FSCANNER_CONFIG");
         testsupport::execBuildProgram({kTool, "--mount-table", mtab, "--cache", cache, "--trace", trace,
-                                       "--trace-level", "2", "--sort", "name", tree});
+                                       "--trace-level", traceLevel, "--sort", "name", tree});
         _exit(98);
     }
+    return pid;
+}
+
+// Starts the tool with --sort on the tree, waits for its trace to show the
+// sort starting, sends it `signal` and waits for it.
+KilledRun killDuringSort(const testsupport::TempDir& dir, const std::string& tree, const std::string& mtab,
+                         const std::string& cache, const std::string& trace, int signal) {
+    ::unlink(trace.c_str());
+    pid_t pid = startSort(dir, tree, mtab, cache, trace, "2", -1);
     KilledRun run;
     const std::string started = "NaturalMergeSort::sort - entering";
     int status = 0;
@@ -196,23 +207,7 @@ TEST(FsQuerySortKill, AKillWhileATraceLineWaitsEndsTheToolAndLeavesNoTemporaryFi
     ASSERT_EQ(0, ::mkfifo(fifo.c_str(), 0600));
     int reader = ::open(fifo.c_str(), O_RDONLY | O_NONBLOCK);
     ASSERT_GE(reader, 0);
-    pid_t pid = fork();
-    if (pid == 0) {
-        int null = ::open("/dev/null", O_RDWR);
-        dup2(null, 0);
-        dup2(null, 1);
-        dup2(null, 2);
-        ::close(reader);
-        setenv("HOME", dir.file("home").c_str(), 1);
-        setenv("XDG_CACHE_HOME", dir.file("xdg").c_str(), 1);
-        setenv("TMPDIR", dir.file("tmp").c_str(), 1);
-        unsetenv("FSCANNER_TRACE_LEVEL");
-        unsetenv("FSCANNER_TRACE_FILE");
-        unsetenv("FSCANNER_CONFIG");
-        testsupport::execBuildProgram({kTool, "--mount-table", mtab, "--cache", cache, "--trace", fifo,
-                                       "--trace-level", "3", "--sort", "name", tree});
-        _exit(98);
-    }
+    pid_t pid = startSort(dir, tree, mtab, cache, fifo, "3", reader);
     ASSERT_GT(pid, 0);
     // Full: what the pipe holds stops growing while the tool lives.
     int status = 0;
