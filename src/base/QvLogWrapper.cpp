@@ -1,11 +1,11 @@
 #include "base/QvLogWrapper.h"
 
+#include <atomic>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <cwchar>
-#include <atomic>
 #include <mutex>
 
 #include "base/KelCfg.h"
@@ -290,7 +290,7 @@ std::vector<QvLogWrapper::Message> QvLogWrapper::captured() {
 
 void QvLogWrapper::emit(int level, int line, const char* file, const char* function,
                         const char* fmt, va_list args) {
-    if (gSilenced.load(std::memory_order_relaxed) || !istraceActive(level)) return;
+    if (!istraceActive(level)) return;  // false once silenced, before any lock
     std::string text = formatArgs(fmt, args);
     std::lock_guard<std::mutex> g(impl_->lock);
     if (impl_->capturing && level <= impl_->captureLevel) impl_->messages.push_back({level, text});
