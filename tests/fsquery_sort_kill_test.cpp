@@ -161,14 +161,27 @@ KilledRun killDuringSort(const testsupport::TempDir& dir, const std::string& tre
     return run;
 }
 
-TEST(FsQuerySortKill, TwoHundredThousandFilesKilledDuringTheSortLeaveNoTemporaryFile) {
+// What each test starts from: a tree of `directories` x `files` in the
+// workspace, a mount table, the cache's place, and "tmp" for the tool's
+// temporary files.
+struct Scene {
     Workspace space;
-    const testsupport::TempDir& dir = space.dir;
-    std::string tree = space.file("tree");
-    makeTree(tree, 400, 500);
-    std::string mtab = dir.write("mtab", "/dev/vda / ext4 rw 0 0\n");
-    std::string cache = space.file("cache");
-    dir.mkdirs("tmp");
+    std::string tree;
+    std::string mtab;
+    std::string cache;
+    Scene(int directories, int files) : tree(space.file("tree")), cache(space.file("cache")) {
+        makeTree(tree, directories, files);
+        mtab = space.dir.write("mtab", "/dev/vda / ext4 rw 0 0\n");
+        space.dir.mkdirs("tmp");
+    }
+};
+
+TEST(FsQuerySortKill, TwoHundredThousandFilesKilledDuringTheSortLeaveNoTemporaryFile) {
+    Scene scene(400, 500);
+    const testsupport::TempDir& dir = scene.space.dir;
+    const std::string& tree = scene.tree;
+    const std::string& mtab = scene.mtab;
+    const std::string& cache = scene.cache;
     std::string trace = dir.file("trace.log");
 
     // A terminal that goes away (SIGHUP) and an interrupt end the tool as
@@ -196,18 +209,14 @@ TEST(FsQuerySortKill, TwoHundredThousandFilesKilledDuringTheSortLeaveNoTemporary
 // the tool stops inside a trace write once the pipe is full; the result file
 // of its sort exists by then.
 TEST(FsQuerySortKill, AKillWhileATraceLineWaitsEndsTheToolAndLeavesNoTemporaryFile) {
-    Workspace space;
-    const testsupport::TempDir& dir = space.dir;
-    std::string tree = space.file("tree");
-    makeTree(tree, 300, 5);
-    std::string mtab = dir.write("mtab", "/dev/vda / ext4 rw 0 0\n");
-    std::string cache = space.file("cache");
-    dir.mkdirs("tmp");
+    Scene scene(300, 5);
+    const testsupport::TempDir& dir = scene.space.dir;
+    const std::string& cache = scene.cache;
     std::string fifo = dir.file("trace.fifo");
     ASSERT_EQ(0, ::mkfifo(fifo.c_str(), 0600));
     int reader = ::open(fifo.c_str(), O_RDONLY | O_NONBLOCK);
     ASSERT_GE(reader, 0);
-    pid_t pid = startSort(dir, tree, mtab, cache, fifo, "3", reader);
+    pid_t pid = startSort(dir, scene.tree, scene.mtab, cache, fifo, "3", reader);
     ASSERT_GT(pid, 0);
     // Full: what the pipe holds stops growing while the tool lives.
     int status = 0;
