@@ -430,7 +430,7 @@ TEST(IndexWholeCheck, PassInFileOrderAgreesWithTheChainWalk) {
             std::memcpy(out, words.data() + static_cast<size_t>(first) * 2, static_cast<size_t>(count) * 8);
             return true;
         };
-        std::vector<uint32_t> byPass, byChains;
+        BucketMap byPass, byChains;
         bool passSound = indexChainsSound(readSlots, total, checkedRecords, byPass);
         char const* damage = indexChainsDamage(words, total, checkedRecords, byChains);
         ASSERT_EQ(damage == nullptr, passSound) << "trial " << trial << ": " << (damage ? damage : "sound");

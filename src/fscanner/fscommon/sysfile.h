@@ -14,6 +14,7 @@
 
 #include <cstdint>
 #include <cstdio>
+#include <typeinfo>
 #include <vector>
 
 const int SEEK_FROM_START = 1;
@@ -258,5 +259,12 @@ private:
     uint32_t budgetPages;
     size_t mappedLength;  // bytes of the current mapping, 0 when none
 };
+
+// file as a LinuxMmFile when it is one (and no class derived from it), else
+// null: the table's readers take the bytes of such a file in place, through
+// view, where a seek and a copying read would cost more than the bytes.
+inline LinuxMmFile* exactlyMapped(AbstractFile* file) {
+    return file != nullptr && typeid(*file) == typeid(LinuxMmFile) ? static_cast<LinuxMmFile*>(file) : nullptr;
+}
 
 #endif

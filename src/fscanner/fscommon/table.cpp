@@ -245,6 +245,18 @@ bool Index::erase() {
 
 bool Index::read(unsigned int slot, unsigned int* id, unsigned int* next) {
     if (file == nullptr) return false;
+    // A lookup reads a slot here and there: in place, where the mapping has
+    // it whole (no caller reads on from where this read ends).
+    if (LinuxMmFile* mapped = exactlyMapped(file)) {
+        uint64_t at = static_cast<uint64_t>(slot) * 8;
+        uint32_t got = 0;
+        const char* both = at <= 0x7FFFFFF7ull ? mapped->view(static_cast<uint32_t>(at), 8, &got) : nullptr;
+        if (both != nullptr && got == 8) {
+            *id = codec::decodeFixed32(both);
+            *next = codec::decodeFixed32(both + 4);
+            return true;
+        }
+    }
     if (!file->seek(static_cast<long>(static_cast<unsigned long long>(slot) * 8), SEEK_FROM_START)) return false;
     char both[8];
     if (file->read(both, 8) != 8) return false;
@@ -570,6 +582,16 @@ bool FS_Table::insert(Fields& record) {
 bool FS_Table::readSlot(unsigned int id, uint32_t* offset) {
     unsigned long long position = static_cast<unsigned long long>(id) * kSlotSize;
     if (position > 0x7FFFFFFFull) return false;
+    // In place where the mapping holds the slot whole; a slot it does not
+    // is read as before, which leaves the end flag moveFirst looks at.
+    if (LinuxMmFile* mapped = exactlyMapped(pointerFile)) {
+        uint32_t got = 0;
+        const char* word = mapped->view(static_cast<uint32_t>(position), kSlotSize, &got);
+        if (word != nullptr && got == kSlotSize) {
+            *offset = codec::decodeFixed32(word);
+            return true;
+        }
+    }
     if (!pointerFile->seek(static_cast<long>(position), SEEK_FROM_START)) return false;
     return readWord(pointerFile, offset);
 }
@@ -922,6 +944,59 @@ FS_Table::PeekDecode FS_Table::decodePeeked(const unsigned char* bytes, uint32_t
     return PeekDecode::Done;
 }
 
+bool FS_Table::decodeRoomyRow(const unsigned char* bytes, uint32_t available, const unsigned char* kinds,
+                              unsigned int count, uint32_t* length) {
+    // Room for the longest number behind every column start, so that each
+    // column is checked once; a text's bytes are checked on their own.
+    const uint32_t room = static_cast<uint32_t>(codec::kMaxCompressedLength) + 1;
+    uint32_t pos = bitmapSize <= kBitmapBufferSize ? bitmapSize : kBitmapBufferSize;
+    if (!compressed || count == 0 || peekColumns.size() < count || pos > available) return false;
+    PeekedColumn* columns = peekColumns.data();
+    for (unsigned int i = 0; i < count; ++i) {
+        if (available - pos < room) return false;
+        PeekedColumn& c = columns[i];
+        unsigned int kind = kinds[i];
+        c.length = 0;
+        c.number = 0;
+        c.ascii = -1;
+        if (kind == FIELD_INT8) {
+            c.at = pos;
+            c.number = bytes[pos];
+            pos += 1;
+            continue;
+        }
+        uint64_t v;
+        uint32_t used;
+        unsigned char first = bytes[pos];
+        if ((first & 1) == 0) {
+            v = first >> 1;
+            used = 1;
+        } else {
+            int n = codec::decodeCompressed(reinterpret_cast<const char*>(bytes) + pos, available - pos, &v);
+            if (n == 0) return false;
+            used = static_cast<uint32_t>(n);
+        }
+        if (kind == FIELD_TEXT) {
+            if (v > 0xFFFFull) return false;
+            pos += used;
+            if (available - pos < v) return false;
+            c.at = pos;
+            c.length = static_cast<uint32_t>(v);
+            pos += static_cast<uint32_t>(v);
+        } else if (kind >= FIELD_INT16 && kind <= FIELD_INT64) {
+            if (kind == FIELD_INT16) v = static_cast<unsigned short>(v);
+            else if (kind == FIELD_INT32) v = static_cast<unsigned int>(v);
+            c.at = pos;
+            c.number = v;
+            pos += used;
+        } else {
+            return false;
+        }
+    }
+    *length = pos;
+    return true;
+}
+
 bool FS_Table::peekRecord(uint32_t offset, Fields& layout, uint32_t* end) {
     if (layout.count() == 0 || !dataFile->seek(static_cast<long>(offset), SEEK_FROM_START)) return false;
     if (peekBytes.size() < kPeekFirstRead) peekBytes.resize(kPeekFirstRead);
@@ -1072,10 +1147,13 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
         keyColumn[keys++] = static_cast<unsigned int>(keyAt);
     }
     const uint32_t* upper = upperAsciiTable();
+    unsigned char kinds[kMaxFields];
+    for (unsigned int i = 0; i < count; ++i) kinds[i] = static_cast<unsigned char>(schema.at(i)->getType());
+    if (peekColumns.size() < count) peekColumns.resize(count);
 
     // The table's files are mapped and lend their bytes in place.
-    LinuxMmFile* mappedSlots = dynamic_cast<LinuxMmFile*>(pointerFile);
-    LinuxMmFile* mappedData = dynamic_cast<LinuxMmFile*>(dataFile);
+    LinuxMmFile* mappedSlots = exactlyMapped(pointerFile);
+    LinuxMmFile* mappedData = exactlyMapped(dataFile);
     if (mappedSlots == nullptr || mappedData == nullptr) return;
     uint32_t slots[kSkipMostSlots];
     uint32_t wantSlots = kSkipFirstSlots;
@@ -1138,7 +1216,9 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
                 if (wantBytes < kSkipMostBytes) wantBytes *= 2;
             }
             uint32_t at = offset - windowStart;
-            decoded = decodePeeked(window + at, windowHave - at, windowEnd, schema, &length);
+            decoded = decodeRoomyRow(window + at, windowHave - at, kinds, count, &length)
+                          ? PeekDecode::Done
+                          : decodePeeked(window + at, windowHave - at, windowEnd, schema, &length);
             if (decoded == PeekDecode::NeedMore) {
                 if (length > kSkipMostBytes) return;
                 while (wantBytes < length) wantBytes *= 2;

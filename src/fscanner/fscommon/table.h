@@ -323,6 +323,12 @@ private:
     enum class PeekDecode { Done, NeedMore, Broken };
     PeekDecode decodePeeked(const unsigned char* bytes, uint32_t available, bool complete, Fields& layout,
                             uint32_t* length);
+    // decodePeeked on a compressed table's row with room to spare behind
+    // each column, the column types given as kinds (FIELD_* values): true
+    // with what decodePeeked answers Done with; false wherever it might
+    // answer otherwise, for decodePeeked to decide.
+    bool decodeRoomyRow(const unsigned char* bytes, uint32_t available, const unsigned char* kinds,
+                        unsigned int count, uint32_t* length);
     // Stores the columns the last peekRecord found into the first count
     // fields of record, as the field-by-field read would; false when a text
     // finds no memory (the fields before it are stored).

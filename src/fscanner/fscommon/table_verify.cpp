@@ -32,6 +32,7 @@
 #include <cerrno>
 #include <cstring>
 #include <cwchar>
+#include <memory>
 #include <vector>
 
 #include "base/kelmem.h"
@@ -96,6 +97,21 @@ int keyBucket(Field* field) {
 
 }  // namespace
 
+// ---- BucketMap ---------------------------------------------------------------
+
+void BucketMap::assignUnknown(uint32_t records) {
+    buckets.assign(records, 0);
+    filed.assign((static_cast<size_t>(records) + 63) / 64, 0);
+    unfiled = records;
+}
+
+void BucketMap::grow(uint32_t records) {
+    if (records <= buckets.size()) return;
+    unfiled += records - static_cast<uint32_t>(buckets.size());
+    buckets.resize(records, 0);
+    filed.resize((static_cast<size_t>(records) + 63) / 64, 0);
+}
+
 // ---- Index -------------------------------------------------------------------
 
 bool Index::slotCount(unsigned int* count) {
@@ -110,12 +126,24 @@ bool Index::readSlots(unsigned int first, unsigned int count, uint32_t* words) {
     if (file == nullptr) return false;
     if (!file->seek(static_cast<long>(static_cast<unsigned long long>(first) * 8), SEEK_FROM_START)) return false;
     const unsigned int block = 8192;  // slots per read
+    // A mapped file lends each block in place, to be decoded from there;
+    // it is looked at block by block all the same, as the reads would.
+    LinuxMmFile* mapped = exactlyMapped(file);
     for (unsigned int done = 0; done < count;) {
         unsigned int n = count - done < block ? count - done : block;
-        // Read straight into words and decode each word where it lies.
         uint32_t* at = words + static_cast<size_t>(done) * 2;
-        if (file->read(at, n * 8) != n * 8) return false;
-        for (unsigned int i = 0; i < n * 2; ++i) at[i] = codec::decodeFixed32(reinterpret_cast<const char*>(at + i));
+        uint64_t from = (static_cast<uint64_t>(first) + done) * 8;
+        uint32_t got = 0;
+        const char* slots = mapped != nullptr && from + static_cast<uint64_t>(n) * 8 <= 0x7FFFFFFFull
+                                ? mapped->view(static_cast<uint32_t>(from), n * 8, &got)
+                                : nullptr;
+        if (slots != nullptr && got == n * 8) {
+            for (unsigned int i = 0; i < n * 2; ++i) at[i] = codec::decodeFixed32(slots + static_cast<size_t>(i) * 4);
+        } else {
+            // Read straight into words and decode each word where it lies.
+            if (!file->seek(static_cast<long>(from), SEEK_FROM_START) || file->read(at, n * 8) != n * 8) return false;
+            for (unsigned int i = 0; i < n * 2; ++i) at[i] = codec::decodeFixed32(reinterpret_cast<const char*>(at + i));
+        }
         done += n;
     }
     return true;
@@ -289,8 +317,8 @@ bool FS_Table::verifyIndex(TableGuard::IndexBuckets& entry, uint32_t slots) {
 }
 
 char const* indexChainsDamage(const std::vector<uint32_t>& words, uint32_t total, uint32_t records,
-                              std::vector<uint32_t>& bucketOf) {
-    bucketOf.assign(records, TableGuard::UNKNOWN_BUCKET);
+                              BucketMap& bucketOf) {
+    bucketOf.assignUnknown(records);
     std::vector<bool> reached(total - Index::BUCKETS, false);
     uint32_t entries = 0;
     uint32_t overflowReached = 0;
@@ -306,8 +334,8 @@ char const* indexChainsDamage(const std::vector<uint32_t>& words, uint32_t total
         for (;;) {
             if (id == Index::EMPTY) return "empty slot inside a chain";
             if (id >= records) return "index entry names a record past the pointer file";
-            if (bucketOf[id] != TableGuard::UNKNOWN_BUCKET) return "record filed twice in the index";
-            bucketOf[id] = bucket;
+            if (bucketOf.at(id) != BucketMap::UNKNOWN) return "record filed twice in the index";
+            bucketOf.set(id, bucket);
             ++entries;
             if (next == Index::EMPTY) break;
             // Overflow slots are appended and linked to older ones, so along
@@ -328,26 +356,35 @@ char const* indexChainsDamage(const std::vector<uint32_t>& words, uint32_t total
 }
 
 bool indexChainsSound(const std::function<bool(uint32_t, uint32_t, uint32_t*)>& readSlots, uint32_t total,
-                      uint32_t records, std::vector<uint32_t>& bucketOf) {
+                      uint32_t records, BucketMap& bucketOf) {
     if (total < Index::BUCKETS) return false;
-    bucketOf.assign(records, TableGuard::UNKNOWN_BUCKET);
+    bucketOf.assignUnknown(records);
     // The bucket of each overflow slot's chain, set by the one slot that
     // links to it: buckets number 65536, so 16 bits hold one.
     static_assert(Index::BUCKETS <= 65536, "a bucket number fits 16 bits");
     const uint32_t overflow = total - Index::BUCKETS;
-    std::vector<uint16_t> chainOf(overflow);
-    std::vector<uint8_t> linked(overflow, 0);
+    // Read only where linked says it was written, so left uninitialised.
+    std::unique_ptr<uint16_t[]> chainOf(new uint16_t[overflow != 0 ? overflow : 1]);
+    // A bit a slot: this pass, too, is memory every large query clears anew.
+    std::vector<uint64_t> linked((static_cast<size_t>(overflow) + 63) / 64, 0);
+    auto isLinked = [&linked](uint32_t o) { return ((linked[o / 64] >> (o % 64)) & 1) != 0; };
+    // Marks o linked; false when it was already.
+    auto link = [&linked](uint32_t o) {
+        uint64_t& word = linked[o / 64];
+        uint64_t bit = static_cast<uint64_t>(1) << (o % 64);
+        if ((word & bit) != 0) return false;
+        word |= bit;
+        return true;
+    };
     uint32_t entries = 0;
     // One slot of a chain whose bucket is known: its record and its link.
     auto visit = [&](uint32_t slot, uint32_t bucket, uint32_t id, uint32_t next) {
-        if (id == Index::EMPTY || id >= records || bucketOf[id] != TableGuard::UNKNOWN_BUCKET) return false;
-        bucketOf[id] = bucket;
+        if (id == Index::EMPTY || id >= records || !bucketOf.fileOnce(id, bucket)) return false;
         ++entries;
         if (next == Index::EMPTY) return true;
         if (next < Index::BUCKETS || next >= total || (slot >= Index::BUCKETS && next >= slot)) return false;
         uint32_t o = next - Index::BUCKETS;
-        if (linked[o] != 0) return false;
-        linked[o] = 1;
+        if (!link(o)) return false;
         chainOf[o] = static_cast<uint16_t>(bucket);
         return true;
     };
@@ -372,7 +409,7 @@ bool indexChainsSound(const std::function<bool(uint32_t, uint32_t, uint32_t*)>& 
         for (uint32_t i = n; i-- > 0;) {
             uint32_t slot = first + i, o = slot - Index::BUCKETS;
             // Every slot that links here stands higher, or is a bucket.
-            if (linked[o] == 0) return false;
+            if (!isLinked(o)) return false;
             if (!visit(slot, chainOf[o], words[static_cast<size_t>(i) * 2], words[static_cast<size_t>(i) * 2 + 1]))
                 return false;
         }
@@ -572,8 +609,9 @@ void FS_Table::guardInsert(Fields& record, unsigned int id) {
     guard->walking = false;
     for (TableGuard::IndexBuckets& entry : guard->indexes) {
         if (!entry.whole) continue;
-        if (entry.bucketOf.size() <= id) entry.bucketOf.resize(static_cast<size_t>(id) + 1, TableGuard::UNKNOWN_BUCKET);
+        if (id == 0xFFFFFFFFu) continue;  // no pointer file reaches it
+        if (entry.bucketOf.size() <= id) entry.bucketOf.grow(id + 1);
         int bucket = keyBucket(record.name(entry.field.c_str()));
-        entry.bucketOf[id] = bucket >= 0 ? static_cast<uint32_t>(bucket) : TableGuard::UNKNOWN_BUCKET;
+        entry.bucketOf.set(id, bucket >= 0 ? static_cast<uint32_t>(bucket) : BucketMap::UNKNOWN);
     }
 }

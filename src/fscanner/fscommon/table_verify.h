@@ -14,10 +14,64 @@
 class Fields;
 class Index;
 
-struct TableGuard {
+// The bucket each record number of a table is filed under in one index:
+// two bytes a record, since buckets number 65536, and a bit for the records
+// filed nowhere.  A query that reads every row fills and reads one of these
+// per index, so its size is pages that are faulted in and cleared anew by
+// every such query: plain words would be twice as many.
+class BucketMap {
+public:
     // A record number with no entry in an index (its field was null at
     // insert) has this bucket, and its key is not checked.
-    static constexpr uint32_t UNKNOWN_BUCKET = 0xFFFFFFFFu;
+    static constexpr uint32_t UNKNOWN = 0xFFFFFFFFu;
+
+    // records numbers, none filed.
+    void assignUnknown(uint32_t records);
+    // Grows to records numbers; the new ones are filed nowhere.
+    void grow(uint32_t records);
+    uint32_t size() const { return static_cast<uint32_t>(buckets.size()); }
+    // UNKNOWN for a number filed nowhere or past the end.
+    uint32_t at(uint32_t id) const {
+        if (id >= buckets.size()) return UNKNOWN;
+        // A sound index files every record: the bits need no look then.
+        if (unfiled != 0 && ((filed[id / 64] >> (id % 64)) & 1) == 0) return UNKNOWN;
+        return buckets[id];
+    }
+    // bucket is below 65536, or UNKNOWN; id is below size().
+    void set(uint32_t id, uint32_t bucket) {
+        uint64_t& word = filed[id / 64];
+        uint64_t bit = static_cast<uint64_t>(1) << (id % 64);
+        if (bucket == UNKNOWN) {
+            if ((word & bit) != 0) ++unfiled;
+            word &= ~bit;
+            buckets[id] = 0;
+        } else {
+            if ((word & bit) == 0) --unfiled;
+            word |= bit;
+            buckets[id] = static_cast<uint16_t>(bucket);
+        }
+    }
+    // Files id (below size()) under bucket (below 65536) unless it is filed
+    // already: false then, and nothing changes.
+    bool fileOnce(uint32_t id, uint32_t bucket) {
+        uint64_t& word = filed[id / 64];
+        uint64_t bit = static_cast<uint64_t>(1) << (id % 64);
+        if ((word & bit) != 0) return false;
+        word |= bit;
+        --unfiled;
+        buckets[id] = static_cast<uint16_t>(bucket);
+        return true;
+    }
+    bool operator==(const BucketMap& other) const { return buckets == other.buckets && filed == other.filed; }
+
+private:
+    std::vector<uint16_t> buckets;  // 0 where not filed
+    std::vector<uint64_t> filed;    // bit id: buckets[id] holds its bucket
+    uint32_t unfiled = 0;           // numbers below size() whose bit is clear
+};
+
+struct TableGuard {
+    static constexpr uint32_t UNKNOWN_BUCKET = BucketMap::UNKNOWN;
 
     struct IndexBuckets {
         // Compared only, never followed unless the table's own list still
@@ -34,11 +88,12 @@ struct TableGuard {
         // open, so a slot below it needs no new measure.
         uint32_t slots = 0;
         // Valid when whole: the bucket each record number is filed under.
-        std::vector<uint32_t> bucketOf;
+        BucketMap bucketOf;
         // When whole: record id, whose key falls in bucket, is filed there
         // (or has no entry).
         bool holds(uint32_t id, uint32_t bucket) const {
-            return id >= bucketOf.size() || bucketOf[id] == UNKNOWN_BUCKET || bucketOf[id] == bucket;
+            uint32_t filed = bucketOf.at(id);
+            return filed == UNKNOWN_BUCKET || filed == bucket;
         }
     };
 
@@ -108,8 +163,8 @@ struct TableGuard {
 // before the pass reaches it, and the pass touches memory in order instead
 // of jumping along chains, which on a large index is a cache miss a slot.
 char const* indexChainsDamage(const std::vector<uint32_t>& words, uint32_t total, uint32_t records,
-                              std::vector<uint32_t>& bucketOf);
+                              BucketMap& bucketOf);
 bool indexChainsSound(const std::function<bool(uint32_t, uint32_t, uint32_t*)>& readSlots, uint32_t total,
-                      uint32_t records, std::vector<uint32_t>& bucketOf);
+                      uint32_t records, BucketMap& bucketOf);
 
 #endif
