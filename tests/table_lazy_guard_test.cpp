@@ -425,13 +425,12 @@ TEST(IndexWholeCheck, PassInFileOrderAgreesWithTheChainWalk) {
                 break;
             }
         }
-        auto readSlots = [&words](uint32_t first, uint32_t count, uint32_t* out) {
-            if (static_cast<size_t>(first + count) * 2 > words.size()) return false;
-            std::memcpy(out, words.data() + static_cast<size_t>(first) * 2, static_cast<size_t>(count) * 8);
-            return true;
+        auto slotBytes = [&words](uint32_t first, uint32_t count) -> const char* {
+            if (static_cast<size_t>(first + count) * 2 > words.size()) return nullptr;
+            return reinterpret_cast<const char*>(words.data() + static_cast<size_t>(first) * 2);
         };
         BucketMap byPass, byChains;
-        bool passSound = indexChainsSound(readSlots, total, checkedRecords, byPass);
+        bool passSound = indexChainsSound(slotBytes, total, checkedRecords, byPass);
         char const* damage = indexChainsDamage(words, total, checkedRecords, byChains);
         ASSERT_EQ(damage == nullptr, passSound) << "trial " << trial << ": " << (damage ? damage : "sound");
         if (passSound) {

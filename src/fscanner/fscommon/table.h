@@ -81,6 +81,10 @@ public:
     // Reads count slots from slot first into words, two words a slot; false
     // on a short read.
     bool readSlots(unsigned int first, unsigned int count, uint32_t* words);
+    // The bytes of count slots from slot first as stored (two host-order
+    // words a slot): in place in a mapping that holds them, else read into
+    // spare; null on a short read.  Valid until the file or spare changes.
+    const char* slotBytes(unsigned int first, unsigned int count, std::vector<char>& spare);
 
 private:
     Index& operator=(const Index&) = delete;

@@ -122,28 +122,33 @@ bool Index::slotCount(unsigned int* count) {
     return true;
 }
 
+const char* Index::slotBytes(unsigned int first, unsigned int count, std::vector<char>& spare) {
+    if (file == nullptr) return nullptr;
+    uint64_t from = static_cast<uint64_t>(first) * 8, bytes = static_cast<uint64_t>(count) * 8;
+    if (from + bytes > 0x7FFFFFFFull) return nullptr;
+    if (LinuxMmFile* mapped = exactlyMapped(file)) {
+        uint32_t got = 0;
+        const char* slots = mapped->view(static_cast<uint32_t>(from), static_cast<uint32_t>(bytes), &got);
+        if (slots != nullptr && got == bytes) return slots;
+    }
+    spare.resize(static_cast<size_t>(bytes));
+    if (!file->seek(static_cast<long>(from), SEEK_FROM_START)) return nullptr;
+    if (file->read(spare.data(), static_cast<unsigned int>(bytes)) != bytes) return nullptr;
+    return spare.data();
+}
+
 bool Index::readSlots(unsigned int first, unsigned int count, uint32_t* words) {
     if (file == nullptr) return false;
     if (!file->seek(static_cast<long>(static_cast<unsigned long long>(first) * 8), SEEK_FROM_START)) return false;
+    // Block by block, as a pass reads the file.
     const unsigned int block = 8192;  // slots per read
-    // A mapped file lends each block in place, to be decoded from there;
-    // it is looked at block by block all the same, as the reads would.
-    LinuxMmFile* mapped = exactlyMapped(file);
+    std::vector<char> spare;
     for (unsigned int done = 0; done < count;) {
         unsigned int n = count - done < block ? count - done : block;
+        const char* slots = slotBytes(first + done, n, spare);
+        if (slots == nullptr) return false;
         uint32_t* at = words + static_cast<size_t>(done) * 2;
-        uint64_t from = (static_cast<uint64_t>(first) + done) * 8;
-        uint32_t got = 0;
-        const char* slots = mapped != nullptr && from + static_cast<uint64_t>(n) * 8 <= 0x7FFFFFFFull
-                                ? mapped->view(static_cast<uint32_t>(from), n * 8, &got)
-                                : nullptr;
-        if (slots != nullptr && got == n * 8) {
-            for (unsigned int i = 0; i < n * 2; ++i) at[i] = codec::decodeFixed32(slots + static_cast<size_t>(i) * 4);
-        } else {
-            // Read straight into words and decode each word where it lies.
-            if (!file->seek(static_cast<long>(from), SEEK_FROM_START) || file->read(at, n * 8) != n * 8) return false;
-            for (unsigned int i = 0; i < n * 2; ++i) at[i] = codec::decodeFixed32(reinterpret_cast<const char*>(at + i));
-        }
+        for (unsigned int i = 0; i < n * 2; ++i) at[i] = codec::decodeFixed32(slots + static_cast<size_t>(i) * 4);
         done += n;
     }
     return true;
@@ -301,10 +306,9 @@ bool FS_Table::verifyIndex(TableGuard::IndexBuckets& entry, uint32_t slots) {
     unsigned int total = 0;
     if (!index.slotCount(&total)) return noteDamage(path, "index file size is not whole slots");
     if (total < Index::BUCKETS) return noteDamage(path, "index file is shorter than its buckets");
-    auto readSlots = [&index](uint32_t first, uint32_t count, uint32_t* words) {
-        return index.readSlots(first, count, words);
-    };
-    if (!indexChainsSound(readSlots, total, slots, entry.bucketOf)) {
+    std::vector<char> spare;
+    auto slotBytes = [&index, &spare](uint32_t first, uint32_t count) { return index.slotBytes(first, count, spare); };
+    if (!indexChainsSound(slotBytes, total, slots, entry.bucketOf)) {
         // Damaged (or unreadable): walk the chains as a lookup would, to
         // name the damage a lookup meets first.
         std::vector<uint32_t> words(static_cast<size_t>(total) * 2);
@@ -355,7 +359,7 @@ char const* indexChainsDamage(const std::vector<uint32_t>& words, uint32_t total
     return nullptr;
 }
 
-bool indexChainsSound(const std::function<bool(uint32_t, uint32_t, uint32_t*)>& readSlots, uint32_t total,
+bool indexChainsSound(const std::function<const char*(uint32_t, uint32_t)>& slotBytes, uint32_t total,
                       uint32_t records, BucketMap& bucketOf) {
     if (total < Index::BUCKETS) return false;
     bucketOf.assignUnknown(records);
@@ -389,12 +393,16 @@ bool indexChainsSound(const std::function<bool(uint32_t, uint32_t, uint32_t*)>& 
         return true;
     };
     const uint32_t block = 8192;  // slots per read
-    std::vector<uint32_t> words(static_cast<size_t>(block) * 2);
+    // The two words of slot i of a block, as stored.
+    auto word = [](const char* slots, uint32_t i, uint32_t k) {
+        return codec::decodeFixed32(slots + static_cast<size_t>(i) * 8 + k * 4);
+    };
     for (uint32_t first = 0; first < Index::BUCKETS; first += block) {
         uint32_t n = Index::BUCKETS - first < block ? Index::BUCKETS - first : block;
-        if (!readSlots(first, n, words.data())) return false;
+        const char* slots = slotBytes(first, n);
+        if (slots == nullptr) return false;
         for (uint32_t i = 0; i < n; ++i) {
-            uint32_t id = words[static_cast<size_t>(i) * 2], next = words[static_cast<size_t>(i) * 2 + 1];
+            uint32_t id = word(slots, i, 0), next = word(slots, i, 1);
             if (id == Index::EMPTY) {
                 if (next != Index::EMPTY) return false;
                 continue;
@@ -405,13 +413,13 @@ bool indexChainsSound(const std::function<bool(uint32_t, uint32_t, uint32_t*)>& 
     for (uint32_t end = total; end > Index::BUCKETS;) {
         uint32_t n = end - Index::BUCKETS < block ? end - Index::BUCKETS : block;
         uint32_t first = end - n;
-        if (!readSlots(first, n, words.data())) return false;
+        const char* slots = slotBytes(first, n);
+        if (slots == nullptr) return false;
         for (uint32_t i = n; i-- > 0;) {
             uint32_t slot = first + i, o = slot - Index::BUCKETS;
             // Every slot that links here stands higher, or is a bucket.
             if (!isLinked(o)) return false;
-            if (!visit(slot, chainOf[o], words[static_cast<size_t>(i) * 2], words[static_cast<size_t>(i) * 2 + 1]))
-                return false;
+            if (!visit(slot, chainOf[o], word(slots, i, 0), word(slots, i, 1))) return false;
         }
         end = first;
     }

@@ -157,14 +157,15 @@ struct TableGuard {
 // indexChainsDamage walks the chains bucket by bucket, as a lookup does,
 // and names the first damage it meets (nullptr when sound); it needs every
 // slot in words.  indexChainsSound says only whether the index is sound,
-// reading it through readSlots (first slot, count, words) in blocks: the
+// reading it through slotBytes (first slot, count: the slots' bytes as
+// stored, or null when they cannot be read) in blocks: the
 // buckets first, then the overflow slots from the last down.  A link only
 // ever leads to a lower overflow slot, so every slot's bucket is known
 // before the pass reaches it, and the pass touches memory in order instead
 // of jumping along chains, which on a large index is a cache miss a slot.
 char const* indexChainsDamage(const std::vector<uint32_t>& words, uint32_t total, uint32_t records,
                               BucketMap& bucketOf);
-bool indexChainsSound(const std::function<bool(uint32_t, uint32_t, uint32_t*)>& readSlots, uint32_t total,
+bool indexChainsSound(const std::function<const char*(uint32_t, uint32_t)>& slotBytes, uint32_t total,
                       uint32_t records, BucketMap& bucketOf);
 
 #endif
