@@ -326,4 +326,88 @@ TEST_P(TableSkipTest, EveryDamageOfAnIndexEndsBothWalksAlike) {
 
 INSTANTIATE_TEST_SUITE_P(PlainAndCompressed, TableSkipTest, ::testing::Values(false, true));
 
+// A compressed 16-bit key stored with bits above its width (a 3-byte group
+// number has room for 21) is cut to 16 bits by the full read, so its row is
+// filed where the cut value belongs.  The rows skipRejected passes over must
+// cut it the same way: uncut, the key would not be where its row is filed,
+// and the table would leave every such row to be decided one by one.
+TEST(TableSkipWideKey, AKeyStoredWiderThanItsColumnIsCutAsTheFullReadCutsIt) {
+    testsupport::TempDir dir, locks;
+    char saved[sizeof LinuxSharedMutex::storePath];
+    std::memcpy(saved, LinuxSharedMutex::storePath, sizeof saved);
+    ASSERT_TRUE(LinuxSharedMutex::setStorePath(locks.path().c_str()));
+    std::wstring wdir = wide(dir.path() + "/");
+    const unsigned int kRows = 60;
+    const unsigned short kWide = 40000;  // groups 2, 56, 64: bytes 05 71 80
+    {
+        FS_Table t(L"wide", wdir.c_str(), true);
+        t.addField(L"NAME", FIELD_TEXT);
+        t.addField(L"KEY", FIELD_INT16);
+        ASSERT_TRUE(t.create());
+        ASSERT_TRUE(t.addHashIndex(L"wide_KEY", L"KEY"));
+        for (unsigned int i = 0; i < kRows; ++i) {
+            Fields rec(t.getFields());
+            std::wstring name = L"n" + std::to_wstring(i) + (i % 10 == 9 ? L".c" : L".h");
+            static_cast<TextField*>(rec.at(0))->value(name.c_str());
+            static_cast<Int16Field*>(rec.at(1))->value(kWide);
+            ASSERT_TRUE(t.insert(rec));
+        }
+        t.close();
+    }
+    // Every row's key gets bit 16 set: its top group 2 becomes 6.
+    std::string data = testsupport::readFile(dir.path() + "/wide.dat");
+    unsigned int widened = 0;
+    for (size_t at = 0; at + 3 <= data.size(); ++at) {
+        if (data.compare(at, 3, std::string("\x05\x71\x80", 3)) == 0) {
+            data[at] = '\x0d';
+            ++widened;
+        }
+    }
+    ASSERT_EQ(widened, kRows);
+    writeFile(dir.path() + "/wide.dat", data);
+
+    unsigned int decided = 0;  // rows of the last walk decided one by one
+    auto walk = [&](bool skip) {
+        std::vector<std::string> rows;
+        decided = 0;
+        FS_Table t(L"wide", wdir.c_str(), true);
+        if (!t.open() || !t.verify()) return std::vector<std::string>{"not opened"};
+        unsigned int id = 0;
+        unsigned int wanted = FS_Table::kNoRow;
+        for (bool row = t.moveFirst(id); row; row = t.moveNext(id)) {
+            bool turnedAway = false;
+            if (!(skip && id == wanted)) {
+                ++decided;
+                const unsigned char* text = nullptr;
+                uint32_t length = 0;
+                bool ascii = false;
+                turnedAway = t.peekText(id, 0, &text, &length, &ascii) && ascii && notDotC(nullptr, text, length);
+            }
+            if (!turnedAway) {
+                Fields rec(t.getFields());
+                if (!t.read(id, rec)) {
+                    rows.push_back(std::to_string(id) + " read failed");
+                    break;
+                }
+                rows.push_back(narrow(static_cast<TextField*>(rec.at(0))->value()) + " " +
+                               std::to_string(static_cast<Int16Field*>(rec.at(1))->value()));
+            }
+            if (skip) t.skipRejected(id, 0, notDotC, nullptr, &wanted);
+        }
+        rows.push_back(t.isDamaged() ? std::string("damaged: ") + t.damagedCheck() : "sound");
+        return rows;
+    };
+    std::vector<std::string> rowByRow = walk(false);
+    unsigned int decidedRowByRow = decided;
+    std::vector<std::string> skipping = walk(true);
+    std::memcpy(LinuxSharedMutex::storePath, saved, sizeof saved);
+    EXPECT_EQ(rowByRow, skipping);
+    // The rows between two ".c" names were passed over inside the table.
+    EXPECT_EQ(decidedRowByRow, kRows);
+    EXPECT_LT(decided * 3, kRows);
+    ASSERT_EQ(rowByRow.size(), kRows / 10 + 1);
+    EXPECT_EQ(rowByRow.front(), "n9.c 40000");
+    EXPECT_EQ(rowByRow.back(), "sound");
+}
+
 }  // namespace

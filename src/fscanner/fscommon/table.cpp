@@ -944,56 +944,137 @@ FS_Table::PeekDecode FS_Table::decodePeeked(const unsigned char* bytes, uint32_t
     return PeekDecode::Done;
 }
 
-bool FS_Table::decodeRoomyRow(const unsigned char* bytes, uint32_t available, const unsigned char* kinds,
-                              unsigned int count, uint32_t* length) {
-    // Room for the longest number behind every column start, so that each
-    // column is checked once; a text's bytes are checked on their own.
-    const uint32_t room = static_cast<uint32_t>(codec::kMaxCompressedLength) + 1;
-    uint32_t pos = bitmapSize <= kBitmapBufferSize ? bitmapSize : kBitmapBufferSize;
-    if (!compressed || count == 0 || peekColumns.size() < count || pos > available) return false;
+bool FS_Table::buildSkim(const bool* decoded, SkimStep* steps, unsigned int* count) {
+    unsigned int columns = schema.count();
+    if (!compressed || columns == 0 || columns > kMaxFields || peekColumns.size() < columns) return false;
+    unsigned int n = 0;
+    for (unsigned int i = 0; i < columns; ++i) {
+        unsigned int kind = schema.at(i)->getType();
+        bool number = kind >= FIELD_INT16 && kind <= FIELD_INT64;
+        if (kind != FIELD_INT8 && kind != FIELD_TEXT && !number) return false;
+        SkimStep step;
+        step.kind = static_cast<unsigned char>(kind);
+        step.n = static_cast<unsigned short>(i);
+        if (decoded[i]) {
+            step.op = kind == FIELD_INT8 ? SKIM_INT8 : kind == FIELD_TEXT ? SKIM_TEXT : SKIM_NUMBER;
+        } else if (kind == FIELD_TEXT) {
+            step.op = SKIM_PASS_TEXT;
+        } else {
+            // A run of numbers, or of single bytes, grows by one.
+            unsigned char op = kind == FIELD_INT8 ? SKIM_BYTES : SKIM_NUMBERS;
+            if (n != 0 && steps[n - 1].op == op) {
+                ++steps[n - 1].n;
+                continue;
+            }
+            step.op = op;
+            step.n = 1;
+        }
+        steps[n++] = step;
+    }
+    *count = n;
+    return true;
+}
+
+namespace {
+
+// The bytes of the 7-bit group number at p, which has 8 bytes readable,
+// found without decoding it: where the first clear low bit is.  0 when the
+// number is longer than 8 bytes.
+inline uint32_t groupLength8(const unsigned char* p) {
+#if defined(__BYTE_ORDER__) && __BYTE_ORDER__ == __ORDER_LITTLE_ENDIAN__
+    uint64_t word;
+    std::memcpy(&word, p, 8);
+    uint64_t ends = ~word & 0x0101010101010101ull;
+    return ends == 0 ? 0 : static_cast<uint32_t>(__builtin_ctzll(ends)) / 8 + 1;
+#else
+    for (uint32_t i = 0; i < 8; ++i)
+        if ((p[i] & 1) == 0) return i + 1;
+    return 0;
+#endif
+}
+
+// The value of the group number of used bytes at p, as
+// codec::decodeCompressed sums it.
+inline uint64_t groupValue(const unsigned char* p, uint32_t used) {
+    uint64_t v = 0;
+    for (uint32_t k = 0; k < used; ++k) v = (v << 7) | (p[k] >> 1);
+    return v;
+}
+
+}  // namespace
+
+bool FS_Table::skimRow(const unsigned char* bytes, uint32_t available, const SkimStep* steps, unsigned int count,
+                       uint32_t* length) {
+    uint32_t start = bitmapSize <= kBitmapBufferSize ? bitmapSize : kBitmapBufferSize;
+    if (start > available) return false;
+    const unsigned char* p = bytes + start;
+    const unsigned char* end = bytes + available;
     PeekedColumn* columns = peekColumns.data();
-    for (unsigned int i = 0; i < count; ++i) {
-        if (available - pos < room) return false;
-        PeekedColumn& c = columns[i];
-        unsigned int kind = kinds[i];
-        c.length = 0;
-        c.number = 0;
-        c.ascii = -1;
-        if (kind == FIELD_INT8) {
-            c.at = pos;
-            c.number = bytes[pos];
-            pos += 1;
-            continue;
-        }
-        uint64_t v;
-        uint32_t used;
-        unsigned char first = bytes[pos];
-        if ((first & 1) == 0) {
-            v = first >> 1;
-            used = 1;
-        } else {
-            int n = codec::decodeCompressed(reinterpret_cast<const char*>(bytes) + pos, available - pos, &v);
-            if (n == 0) return false;
-            used = static_cast<uint32_t>(n);
-        }
-        if (kind == FIELD_TEXT) {
-            if (v > 0xFFFFull) return false;
-            pos += used;
-            if (available - pos < v) return false;
-            c.at = pos;
-            c.length = static_cast<uint32_t>(v);
-            pos += static_cast<uint32_t>(v);
-        } else if (kind >= FIELD_INT16 && kind <= FIELD_INT64) {
-            if (kind == FIELD_INT16) v = static_cast<unsigned short>(v);
-            else if (kind == FIELD_INT32) v = static_cast<unsigned int>(v);
-            c.at = pos;
-            c.number = v;
-            pos += used;
-        } else {
-            return false;
+    for (unsigned int s = 0; s < count; ++s) {
+        const SkimStep& step = steps[s];
+        size_t left = static_cast<size_t>(end - p);
+        switch (step.op) {
+            case SKIM_NUMBERS: {
+                // Each number's eight bytes are readable.
+                if (left < 8u * step.n) return false;
+                for (unsigned int k = 0; k < step.n; ++k) {
+                    uint32_t used = groupLength8(p);
+                    if (used == 0) return false;
+                    p += used;
+                }
+                break;
+            }
+            case SKIM_BYTES:
+                if (left < step.n) return false;
+                p += step.n;
+                break;
+            case SKIM_INT8: {
+                if (left < 1) return false;
+                PeekedColumn& c = columns[step.n];
+                c.at = static_cast<uint32_t>(p - bytes);
+                c.length = 0;
+                c.number = *p;
+                c.ascii = -1;
+                p += 1;
+                break;
+            }
+            case SKIM_NUMBER: {
+                if (left < 8) return false;
+                uint32_t used = groupLength8(p);
+                if (used == 0) return false;
+                uint64_t v = groupValue(p, used);
+                // The value as the field would keep it.
+                if (step.kind == FIELD_INT16) v = static_cast<unsigned short>(v);
+                else if (step.kind == FIELD_INT32) v = static_cast<unsigned int>(v);
+                PeekedColumn& c = columns[step.n];
+                c.at = static_cast<uint32_t>(p - bytes);
+                c.length = 0;
+                c.number = v;
+                c.ascii = -1;
+                p += used;
+                break;
+            }
+            default: {  // SKIM_TEXT, SKIM_PASS_TEXT
+                if (left < 8) return false;
+                uint32_t used = groupLength8(p);
+                if (used == 0) return false;
+                uint64_t v = (*p & 1) == 0 ? static_cast<uint64_t>(*p >> 1) : groupValue(p, used);
+                if (v > 0xFFFFull) return false;
+                p += used;
+                if (static_cast<size_t>(end - p) < v) return false;
+                if (step.op == SKIM_TEXT) {
+                    PeekedColumn& c = columns[step.n];
+                    c.at = static_cast<uint32_t>(p - bytes);
+                    c.length = static_cast<uint32_t>(v);
+                    c.number = 0;
+                    c.ascii = -1;
+                }
+                p += static_cast<uint32_t>(v);
+                break;
+            }
         }
     }
-    *length = pos;
+    *length = static_cast<uint32_t>(p - bytes);
     return true;
 }
 
@@ -1147,9 +1228,15 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
         keyColumn[keys++] = static_cast<unsigned int>(keyAt);
     }
     const uint32_t* upper = upperAsciiTable();
-    unsigned char kinds[kMaxFields];
-    for (unsigned int i = 0; i < count; ++i) kinds[i] = static_cast<unsigned char>(schema.at(i)->getType());
+    // The rows are skimmed where they can be: only the keys and the
+    // filtered text are decoded.
     if (peekColumns.size() < count) peekColumns.resize(count);
+    bool looked[kMaxFields] = {};
+    looked[column] = true;
+    for (unsigned int k = 0; k < keys; ++k) looked[keyColumn[k]] = true;
+    SkimStep steps[kMaxFields];
+    unsigned int stepCount = 0;
+    bool skim = buildSkim(looked, steps, &stepCount);
 
     // The table's files are mapped and lend their bytes in place.
     LinuxMmFile* mappedSlots = exactlyMapped(pointerFile);
@@ -1216,7 +1303,7 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
                 if (wantBytes < kSkipMostBytes) wantBytes *= 2;
             }
             uint32_t at = offset - windowStart;
-            decoded = decodeRoomyRow(window + at, windowHave - at, kinds, count, &length)
+            decoded = skim && skimRow(window + at, windowHave - at, steps, stepCount, &length)
                           ? PeekDecode::Done
                           : decodePeeked(window + at, windowHave - at, windowEnd, schema, &length);
             if (decoded == PeekDecode::NeedMore) {

@@ -327,12 +327,26 @@ private:
     enum class PeekDecode { Done, NeedMore, Broken };
     PeekDecode decodePeeked(const unsigned char* bytes, uint32_t available, bool complete, Fields& layout,
                             uint32_t* length);
-    // decodePeeked on a compressed table's row with room to spare behind
-    // each column, the column types given as kinds (FIELD_* values): true
-    // with what decodePeeked answers Done with; false wherever it might
-    // answer otherwise, for decodePeeked to decide.
-    bool decodeRoomyRow(const unsigned char* bytes, uint32_t available, const unsigned char* kinds,
-                        unsigned int count, uint32_t* length);
+    // A compressed table's row as skipRejected passes over it: the columns
+    // it looks at (the keys and the filtered text) decoded, the others only
+    // stepped over, a run of numbers at a time.  buildSkim writes the steps
+    // for the schema, one per decoded column or run, at most one a column;
+    // false for a table it does not serve (integers not compressed, a type
+    // it does not know).  skimRow follows them over a row held in memory
+    // from its first byte: true with the length decodePeeked answers Done
+    // with, and peekColumns as decodePeeked leaves them for the decoded
+    // columns (the others keep what they held); false wherever decodePeeked
+    // might answer otherwise (too few bytes behind a step, a number longer
+    // than eight bytes, a text over 65,535 bytes), for decodePeeked to decide.
+    struct SkimStep {
+        unsigned char op;    // SKIM_* below
+        unsigned char kind;  // FIELD_* type of a decoded column
+        unsigned short n;    // numbers or bytes stepped over; the column decoded
+    };
+    enum : unsigned char { SKIM_NUMBERS, SKIM_BYTES, SKIM_INT8, SKIM_NUMBER, SKIM_TEXT, SKIM_PASS_TEXT };
+    bool buildSkim(const bool* decoded, SkimStep* steps, unsigned int* count);
+    bool skimRow(const unsigned char* bytes, uint32_t available, const SkimStep* steps, unsigned int count,
+                 uint32_t* length);
     // Stores the columns the last peekRecord found into the first count
     // fields of record, as the field-by-field read would; false when a text
     // finds no memory (the fields before it are stored).
