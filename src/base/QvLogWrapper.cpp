@@ -210,6 +210,18 @@ struct QvLogWrapper::Impl {
     bool capturing = false;
     int captureLevel = LEVEL_MAX;
     std::vector<Message> messages;
+    // The highest level that is written or captured, once configured, kept
+    // beside the fields it follows from (under lock, by settle): a trace
+    // above it is answered without the lock.  Most trace calls of a query
+    // are such, one or more a row read.
+    static constexpr int UNSETTLED = LEVEL_MAX + 1;
+    std::atomic<int> active{UNSETTLED};
+
+    void settle() {
+        int highest = level;
+        if (capturing && captureLevel > highest) highest = captureLevel;
+        active.store(configured ? highest : UNSETTLED, std::memory_order_relaxed);
+    }
 
     void configureFromEnvironment() {
         if (configured) return;
@@ -223,6 +235,7 @@ struct QvLogWrapper::Impl {
         if (level < LEVEL_OFF) level = LEVEL_OFF;
         if (level > LEVEL_MAX) level = LEVEL_MAX;
         if (!file.empty()) out = std::fopen(file.c_str(), "a");
+        settle();
     }
 };
 
@@ -237,6 +250,7 @@ bool QvLogWrapper::configure(int level, const char* file) {
     std::lock_guard<std::mutex> g(impl_->lock);
     impl_->configured = true;
     impl_->level = level < LEVEL_OFF ? LEVEL_OFF : (level > LEVEL_MAX ? LEVEL_MAX : level);
+    impl_->settle();
     if (impl_->out != nullptr) std::fclose(impl_->out);
     impl_->out = nullptr;
     if (file != nullptr && *file != '\0') {
@@ -262,6 +276,7 @@ void QvLogWrapper::silenceForSignal() { gSilenced.store(true, std::memory_order_
 
 bool QvLogWrapper::istraceActive(int level) {
     if (gSilenced.load(std::memory_order_relaxed)) return false;
+    if (level > impl_->active.load(std::memory_order_relaxed)) return false;
     std::lock_guard<std::mutex> g(impl_->lock);
     impl_->configureFromEnvironment();
     if (level <= LEVEL_OFF) return false;
@@ -272,12 +287,14 @@ void QvLogWrapper::startCapture(int maxLevel) {
     std::lock_guard<std::mutex> g(impl_->lock);
     impl_->capturing = true;
     impl_->captureLevel = maxLevel;
+    impl_->settle();
     impl_->messages.clear();
 }
 
 std::vector<QvLogWrapper::Message> QvLogWrapper::stopCapture() {
     std::lock_guard<std::mutex> g(impl_->lock);
     impl_->capturing = false;
+    impl_->settle();
     std::vector<Message> result;
     result.swap(impl_->messages);
     return result;
