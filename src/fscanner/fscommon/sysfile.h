@@ -267,4 +267,15 @@ inline LinuxMmFile* exactlyMapped(AbstractFile* file) {
     return file != nullptr && typeid(*file) == typeid(LinuxMmFile) ? static_cast<LinuxMmFile*>(file) : nullptr;
 }
 
+// The bytes [at, at + length) of file in place, counted as read, when it is
+// such a mapped file and holds them all; null otherwise, for the caller to
+// read them the usual way.
+inline const char* mappedBytes(AbstractFile* file, uint64_t at, uint32_t length) {
+    LinuxMmFile* mapped = exactlyMapped(file);
+    if (mapped == nullptr || at + length > 0x7FFFFFFFull) return nullptr;
+    uint32_t got = 0;
+    const char* bytes = mapped->view(static_cast<uint32_t>(at), length, &got);
+    return bytes != nullptr && got == length ? bytes : nullptr;
+}
+
 #endif

@@ -247,15 +247,10 @@ bool Index::read(unsigned int slot, unsigned int* id, unsigned int* next) {
     if (file == nullptr) return false;
     // A lookup reads a slot here and there: in place, where the mapping has
     // it whole (no caller reads on from where this read ends).
-    if (LinuxMmFile* mapped = exactlyMapped(file)) {
-        uint64_t at = static_cast<uint64_t>(slot) * 8;
-        uint32_t got = 0;
-        const char* both = at <= 0x7FFFFFF7ull ? mapped->view(static_cast<uint32_t>(at), 8, &got) : nullptr;
-        if (both != nullptr && got == 8) {
-            *id = codec::decodeFixed32(both);
-            *next = codec::decodeFixed32(both + 4);
-            return true;
-        }
+    if (const char* both = mappedBytes(file, static_cast<uint64_t>(slot) * 8, 8)) {
+        *id = codec::decodeFixed32(both);
+        *next = codec::decodeFixed32(both + 4);
+        return true;
     }
     if (!file->seek(static_cast<long>(static_cast<unsigned long long>(slot) * 8), SEEK_FROM_START)) return false;
     char both[8];
@@ -584,13 +579,9 @@ bool FS_Table::readSlot(unsigned int id, uint32_t* offset) {
     if (position > 0x7FFFFFFFull) return false;
     // In place where the mapping holds the slot whole; a slot it does not
     // is read as before, which leaves the end flag moveFirst looks at.
-    if (LinuxMmFile* mapped = exactlyMapped(pointerFile)) {
-        uint32_t got = 0;
-        const char* word = mapped->view(static_cast<uint32_t>(position), kSlotSize, &got);
-        if (word != nullptr && got == kSlotSize) {
-            *offset = codec::decodeFixed32(word);
-            return true;
-        }
+    if (const char* word = mappedBytes(pointerFile, position, kSlotSize)) {
+        *offset = codec::decodeFixed32(word);
+        return true;
     }
     if (!pointerFile->seek(static_cast<long>(position), SEEK_FROM_START)) return false;
     return readWord(pointerFile, offset);
@@ -1058,7 +1049,8 @@ bool FS_Table::skimRow(const unsigned char* bytes, uint32_t available, const Ski
                 if (left < 8) return false;
                 uint32_t used = groupLength8(p);
                 if (used == 0) return false;
-                uint64_t v = (*p & 1) == 0 ? static_cast<uint64_t>(*p >> 1) : groupValue(p, used);
+                // Most lengths take one byte.
+                uint64_t v = used == 1 ? static_cast<uint64_t>(*p >> 1) : groupValue(p, used);
                 if (v > 0xFFFFull) return false;
                 p += used;
                 if (static_cast<size_t>(end - p) < v) return false;

@@ -101,7 +101,7 @@ int keyBucket(Field* field) {
 
 void BucketMap::assignUnknown(uint32_t records) {
     buckets.assign(records, 0);
-    filed.assign((static_cast<size_t>(records) + 63) / 64, 0);
+    filed.assign(records);
     unfiled = records;
 }
 
@@ -109,7 +109,7 @@ void BucketMap::grow(uint32_t records) {
     if (records <= buckets.size()) return;
     unfiled += records - static_cast<uint32_t>(buckets.size());
     buckets.resize(records, 0);
-    filed.resize((static_cast<size_t>(records) + 63) / 64, 0);
+    filed.grow(records);
 }
 
 // ---- Index -------------------------------------------------------------------
@@ -126,11 +126,7 @@ const char* Index::slotBytes(unsigned int first, unsigned int count, std::vector
     if (file == nullptr) return nullptr;
     uint64_t from = static_cast<uint64_t>(first) * 8, bytes = static_cast<uint64_t>(count) * 8;
     if (from + bytes > 0x7FFFFFFFull) return nullptr;
-    if (LinuxMmFile* mapped = exactlyMapped(file)) {
-        uint32_t got = 0;
-        const char* slots = mapped->view(static_cast<uint32_t>(from), static_cast<uint32_t>(bytes), &got);
-        if (slots != nullptr && got == bytes) return slots;
-    }
+    if (const char* slots = mappedBytes(file, from, static_cast<uint32_t>(bytes))) return slots;
     spare.resize(static_cast<size_t>(bytes));
     if (!file->seek(static_cast<long>(from), SEEK_FROM_START)) return nullptr;
     if (file->read(spare.data(), static_cast<unsigned int>(bytes)) != bytes) return nullptr;
@@ -338,8 +334,7 @@ char const* indexChainsDamage(const std::vector<uint32_t>& words, uint32_t total
         for (;;) {
             if (id == Index::EMPTY) return "empty slot inside a chain";
             if (id >= records) return "index entry names a record past the pointer file";
-            if (bucketOf.at(id) != BucketMap::UNKNOWN) return "record filed twice in the index";
-            bucketOf.set(id, bucket);
+            if (!bucketOf.fileOnce(id, bucket)) return "record filed twice in the index";
             ++entries;
             if (next == Index::EMPTY) break;
             // Overflow slots are appended and linked to older ones, so along
@@ -370,16 +365,8 @@ bool indexChainsSound(const std::function<const char*(uint32_t, uint32_t)>& slot
     // Read only where linked says it was written, so left uninitialised.
     std::unique_ptr<uint16_t[]> chainOf(new uint16_t[overflow != 0 ? overflow : 1]);
     // A bit a slot: this pass, too, is memory every large query clears anew.
-    std::vector<uint64_t> linked((static_cast<size_t>(overflow) + 63) / 64, 0);
-    auto isLinked = [&linked](uint32_t o) { return ((linked[o / 64] >> (o % 64)) & 1) != 0; };
-    // Marks o linked; false when it was already.
-    auto link = [&linked](uint32_t o) {
-        uint64_t& word = linked[o / 64];
-        uint64_t bit = static_cast<uint64_t>(1) << (o % 64);
-        if ((word & bit) != 0) return false;
-        word |= bit;
-        return true;
-    };
+    BitVector linked;
+    linked.assign(overflow);
     uint32_t entries = 0;
     // One slot of a chain whose bucket is known: its record and its link.
     auto visit = [&](uint32_t slot, uint32_t bucket, uint32_t id, uint32_t next) {
@@ -388,7 +375,7 @@ bool indexChainsSound(const std::function<const char*(uint32_t, uint32_t)>& slot
         if (next == Index::EMPTY) return true;
         if (next < Index::BUCKETS || next >= total || (slot >= Index::BUCKETS && next >= slot)) return false;
         uint32_t o = next - Index::BUCKETS;
-        if (!link(o)) return false;
+        if (!linked.testAndSet(o)) return false;
         chainOf[o] = static_cast<uint16_t>(bucket);
         return true;
     };
@@ -418,7 +405,7 @@ bool indexChainsSound(const std::function<const char*(uint32_t, uint32_t)>& slot
         for (uint32_t i = n; i-- > 0;) {
             uint32_t slot = first + i, o = slot - Index::BUCKETS;
             // Every slot that links here stands higher, or is a bucket.
-            if (!isLinked(o)) return false;
+            if (!linked.test(o)) return false;
             if (!visit(slot, chainOf[o], word(slots, i, 0), word(slots, i, 1))) return false;
         }
         end = first;

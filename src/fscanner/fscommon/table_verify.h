@@ -14,6 +14,37 @@
 class Fields;
 class Index;
 
+// A bit a number, all clear at first: the whole check's marks, an eighth of
+// the bytes a flag each would take.
+class BitVector {
+public:
+    // bits numbers, all clear.
+    void assign(uint32_t bits) { words.assign((static_cast<size_t>(bits) + 63) / 64, 0); }
+    // Grows to bits numbers; the new ones clear.
+    void grow(uint32_t bits) { words.resize((static_cast<size_t>(bits) + 63) / 64, 0); }
+    bool test(uint32_t i) const { return ((words[i / 64] >> (i % 64)) & 1) != 0; }
+    // Sets bit i; false when it was set already.
+    bool testAndSet(uint32_t i) {
+        uint64_t& word = words[i / 64];
+        uint64_t bit = static_cast<uint64_t>(1) << (i % 64);
+        if ((word & bit) != 0) return false;
+        word |= bit;
+        return true;
+    }
+    // Clears bit i; false when it was clear already.
+    bool testAndClear(uint32_t i) {
+        uint64_t& word = words[i / 64];
+        uint64_t bit = static_cast<uint64_t>(1) << (i % 64);
+        if ((word & bit) == 0) return false;
+        word &= ~bit;
+        return true;
+    }
+    bool operator==(const BitVector& other) const { return words == other.words; }
+
+private:
+    std::vector<uint64_t> words;
+};
+
 // The bucket each record number of a table is filed under in one index:
 // two bytes a record, since buckets number 65536, and a bit for the records
 // filed nowhere.  A query that reads every row fills and reads one of these
@@ -34,30 +65,23 @@ public:
     uint32_t at(uint32_t id) const {
         if (id >= buckets.size()) return UNKNOWN;
         // A sound index files every record: the bits need no look then.
-        if (unfiled != 0 && ((filed[id / 64] >> (id % 64)) & 1) == 0) return UNKNOWN;
+        if (unfiled != 0 && !filed.test(id)) return UNKNOWN;
         return buckets[id];
     }
     // bucket is below 65536, or UNKNOWN; id is below size().
     void set(uint32_t id, uint32_t bucket) {
-        uint64_t& word = filed[id / 64];
-        uint64_t bit = static_cast<uint64_t>(1) << (id % 64);
         if (bucket == UNKNOWN) {
-            if ((word & bit) != 0) ++unfiled;
-            word &= ~bit;
+            if (filed.testAndClear(id)) ++unfiled;
             buckets[id] = 0;
         } else {
-            if ((word & bit) == 0) --unfiled;
-            word |= bit;
+            if (filed.testAndSet(id)) --unfiled;
             buckets[id] = static_cast<uint16_t>(bucket);
         }
     }
     // Files id (below size()) under bucket (below 65536) unless it is filed
     // already: false then, and nothing changes.
     bool fileOnce(uint32_t id, uint32_t bucket) {
-        uint64_t& word = filed[id / 64];
-        uint64_t bit = static_cast<uint64_t>(1) << (id % 64);
-        if ((word & bit) != 0) return false;
-        word |= bit;
+        if (!filed.testAndSet(id)) return false;
         --unfiled;
         buckets[id] = static_cast<uint16_t>(bucket);
         return true;
@@ -66,7 +90,7 @@ public:
 
 private:
     std::vector<uint16_t> buckets;  // 0 where not filed
-    std::vector<uint64_t> filed;    // bit id: buckets[id] holds its bucket
+    BitVector filed;                // bit id: buckets[id] holds its bucket
     uint32_t unfiled = 0;           // numbers below size() whose bit is clear
 };
 
