@@ -939,14 +939,12 @@ public:
             heldFile = -1;
         }
         for (const std::string& chunk : held) write(chunk.data(), chunk.size());
-        held.clear();
-        heldSize = 0;
+        dropHeld();
     }
     // Drops what waited and ends the holding.
     void discard() {
         buffer.clear();
-        held.clear();
-        heldSize = 0;
+        dropHeld();
         if (heldFile >= 0) ::close(heldFile);
         heldFile = -1;
         holding = false;
@@ -1103,16 +1101,18 @@ private:
                 ::close(heldFile);
                 heldFile = -1;
             }
-            if (heldFile >= 0) {
-                held.clear();
-                heldSize = 0;
-            }
+            if (heldFile >= 0) dropHeld();
         }
         if (heldFile >= 0 && writeAll(heldFile, text)) return;
         heldSize += text.size();
         held.push_back(std::move(text));
         text = std::string();
         text.reserve(kBufferBytes);
+    }
+    // The buffers held in memory, and their count of bytes, go.
+    void dropHeld() {
+        held.clear();
+        heldSize = 0;
     }
     int openHeldFile() const {
 #ifdef O_TMPFILE

@@ -831,6 +831,13 @@ int hashUpperAscii(const unsigned char* text, uint32_t length, const uint32_t* u
 // a second read.
 const uint32_t kPeekFirstRead = 96;
 
+// value as a field of integer type keeps it: cut to the field's width.
+uint64_t keptByField(unsigned int type, uint64_t value) {
+    if (type == FIELD_INT16) return static_cast<unsigned short>(value);
+    if (type == FIELD_INT32) return static_cast<unsigned int>(value);
+    return value;
+}
+
 // hash() of the decimal text of value, as an index files a number.
 int hashDecimal(unsigned int value) {
     wchar_t digits[12];
@@ -904,11 +911,8 @@ FS_Table::PeekDecode FS_Table::decodePeeked(const unsigned char* bytes, uint32_t
                     : type == FIELD_INT32 ? codec::decodeFixed32(at + pos)
                                           : codec::decodeFixed64(at + pos);
             }
-            // The value as the field would keep it.
-            if (type == FIELD_INT16) v = static_cast<unsigned short>(v);
-            else if (type == FIELD_INT32) v = static_cast<unsigned int>(v);
             c.at = pos;
-            c.number = v;
+            c.number = keptByField(type, v);
             pos += used;
         } else if (type == FIELD_TEXT) {
             uint32_t textLength = 0;
@@ -1033,14 +1037,10 @@ bool FS_Table::skimRow(const unsigned char* bytes, uint32_t available, const Ski
                 if (left < 8) return false;
                 uint32_t used = groupLength8(p);
                 if (used == 0) return false;
-                uint64_t v = groupValue(p, used);
-                // The value as the field would keep it.
-                if (step.kind == FIELD_INT16) v = static_cast<unsigned short>(v);
-                else if (step.kind == FIELD_INT32) v = static_cast<unsigned int>(v);
                 PeekedColumn& c = columns[step.n];
                 c.at = static_cast<uint32_t>(p - bytes);
                 c.length = 0;
-                c.number = v;
+                c.number = keptByField(step.kind, groupValue(p, used));
                 c.ascii = -1;
                 p += used;
                 break;
@@ -1107,32 +1107,29 @@ int FS_Table::peekGuardColumn(size_t k) {
     return peekGuardColumns[k].second;
 }
 
-bool FS_Table::peekedBucket(unsigned int column, const unsigned char* bytes, int* bucket) {
-    PeekedColumn& c = peekColumns[column];
-    switch (schema.at(column)->getType()) {
-        case FIELD_INT8:
-        case FIELD_INT16:
-        case FIELD_INT32:
-        case FIELD_INT64: {
-            // Keyed by the low 32 bits, as the index writes it.
-            uint32_t key = static_cast<uint32_t>(c.number);
-            if (lastDecimalBucket < 0 || key != lastDecimal) {
-                lastDecimal = key;
-                lastDecimalBucket = hashDecimal(key);
-            }
-            *bucket = lastDecimalBucket;
-            return true;
-        }
-        case FIELD_TEXT: {
-            if (c.ascii == 0) return false;
-            bool plain = false;
-            *bucket = hashUpperAscii(bytes + c.at, c.length, upperAsciiTable(), &plain);
-            c.ascii = plain ? 1 : 0;
-            return plain;
-        }
-        default:
-            return false;
+inline bool FS_Table::peekedBucketOf(PeekedColumn& c, bool text, const unsigned char* bytes, const uint32_t* upper,
+                                     int* bucket) {
+    if (text) {
+        if (c.ascii == 0) return false;
+        bool plain = false;
+        *bucket = hashUpperAscii(bytes + c.at, c.length, upper, &plain);
+        c.ascii = plain ? 1 : 0;
+        return plain;
     }
+    // Keyed by the low 32 bits, as the index writes it.
+    uint32_t key = static_cast<uint32_t>(c.number);
+    if (lastDecimalBucket < 0 || key != lastDecimal) {
+        lastDecimal = key;
+        lastDecimalBucket = hashDecimal(key);
+    }
+    *bucket = lastDecimalBucket;
+    return true;
+}
+
+bool FS_Table::peekedBucket(unsigned int column, const unsigned char* bytes, int* bucket) {
+    unsigned int type = schema.at(column)->getType();
+    if (type != FIELD_TEXT && (type < FIELD_INT8 || type > FIELD_INT64)) return false;
+    return peekedBucketOf(peekColumns[column], type == FIELD_TEXT, bytes, upperAsciiTable(), bucket);
 }
 
 bool FS_Table::peekPassesGuard(unsigned int id, uint32_t end) {
@@ -1310,23 +1307,8 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
         if (nextKnown && slots[n + 1 - base] != kRemovedSlot && slots[n + 1 - base] != end) return;
         for (unsigned int k = 0; k < keys; ++k) {
             if (guard->reachedIndex == keyEntry[k]->index && guard->reachedId == n) return;
-            PeekedColumn& key = peekColumns[keyColumn[k]];
-            int bucket;
-            if (keyText[k]) {
-                if (key.ascii == 0) return;
-                bool plain = false;
-                bucket = hashUpperAscii(record + key.at, key.length, upper, &plain);
-                key.ascii = plain ? 1 : 0;
-                if (!plain) return;
-            } else {
-                // Keyed by the low 32 bits, as the index writes it.
-                uint32_t number = static_cast<uint32_t>(key.number);
-                if (lastDecimalBucket < 0 || number != lastDecimal) {
-                    lastDecimal = number;
-                    lastDecimalBucket = hashDecimal(number);
-                }
-                bucket = lastDecimalBucket;
-            }
+            int bucket = -1;
+            if (!peekedBucketOf(peekColumns[keyColumn[k]], keyText[k], record, upper, &bucket)) return;
             if (!keyEntry[k]->holds(n, static_cast<uint32_t>(bucket))) return;
         }
         PeekedColumn& text = peekColumns[column];

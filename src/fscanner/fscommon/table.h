@@ -439,6 +439,10 @@ private:
     // decodePeeked); false where only the full read can tell (text that is
     // not plain ASCII).
     bool peekedBucket(unsigned int column, const unsigned char* bytes, int* bucket);
+    // The same for a column whose kind the caller knows (text, or one of the
+    // integer types), with the table of upperAsciiTable().
+    bool peekedBucketOf(PeekedColumn& c, bool text, const unsigned char* bytes, const uint32_t* upper,
+                        int* bucket);
     // towupper of each ASCII code 1..127, for the index keys of peeked text
     // and of inserted text; 0 and 128..255, which no plain ASCII text holds,
     // have a mark no upper case has (kNotPlainAscii).  Filled at first use.
