@@ -52,7 +52,7 @@ set(FSCANNER_LAYER_language
 # the store sits above the language.
 set(FSCANNER_LAYER_store
   fscanner/fscommon/table fscanner/fscommon/table_compact
-  fscanner/fscommon/table_verify fscanner/fscommon/table_format
+  fscanner/fscommon/table_verify fscanner/fscommon/table_format fscanner/fscommon/keyhash
   fscanner/fscommon/recordset fscanner/fscommon/naturalmerge
   fscanner/fscommon/cache_files)
 

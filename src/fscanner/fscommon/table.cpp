@@ -10,6 +10,7 @@
 #include "fscanner/fscommon/cache_files.h"
 #include "fscanner/fscommon/codec.h"
 #include "fscanner/fscommon/env.h"
+#include "fscanner/fscommon/keyhash.h"
 #include "fscanner/fscommon/resolvepath.h"
 #include "fscanner/fscommon/stringhelper.h"
 #include "fscanner/fscommon/sysfactory.h"
@@ -24,7 +25,7 @@ namespace {
 
 // The mark upperAsciiTable() holds for bytes no plain ASCII text holds; no
 // character's upper case has this bit.
-const uint32_t kNotPlainAscii = 0x80000000u;
+const uint32_t kNotPlainAscii = keyhash::kNotPlainMark;
 
 // Closes and deletes file, if there is one, and leaves the pointer null.
 void closeAndDrop(AbstractFile*& file) {
@@ -805,25 +806,20 @@ namespace {
 // hash() of the towupper form of an ASCII text, terminator included, as an
 // index files the key.
 // plain says whether the text is plain ASCII (1..127): only then is the
-// answer the bucket.  upper is FS_Table::upperAsciiTable().
-int hashUpperAscii(const unsigned char* text, uint32_t length, const uint32_t* upper, bool* plain) {
-    uint32_t acc = 0;
-    uint32_t marks = 0;
-    uint32_t i = 0;
-    // Four characters a step: acc * 37^4 + u0 * 37^3 + u1 * 37^2 + u2 * 37 + u3
-    // is the same sum modulo 2^32, with one multiply of acc where there were four.
-    for (; i + 4 <= length; i += 4) {
-        uint32_t u0 = upper[text[i]], u1 = upper[text[i + 1]], u2 = upper[text[i + 2]], u3 = upper[text[i + 3]];
-        acc = acc * 1874161u + (u0 * 50653u + u1 * 1369u) + (u2 * 37u + u3);
-        marks |= (u0 | u1) | (u2 | u3);
-    }
-    for (; i < length; ++i) {
-        uint32_t u = upper[text[i]];
-        acc = acc * 37u + u;
-        marks |= u;
+// answer the bucket.  upper is FS_Table::upperAsciiTable(); words says that
+// it upper-cases as keyhash::upperSumWords does, and readable how many bytes
+// from text on may be read.
+int hashUpperAscii(const unsigned char* text, uint32_t length, uint32_t readable, const uint32_t* upper, bool words,
+                   bool* plain) {
+    uint32_t acc;
+    if (words) {
+        acc = keyhash::upperSumWords(text, length, readable, plain);
+    } else {
+        uint32_t marks = 0;
+        acc = keyhash::upperSumTable(text, length, upper, &marks);
+        *plain = (marks & kNotPlainAscii) == 0;
     }
     acc = acc * 37u;  // the terminator
-    *plain = (marks & kNotPlainAscii) == 0;
     return hash(acc, static_cast<int>(Index::BUCKETS));
 }
 
@@ -988,12 +984,28 @@ inline uint32_t groupLength8(const unsigned char* p) {
 #endif
 }
 
-// The value of the group number of used bytes at p, as
-// codec::decodeCompressed sums it.
+// The value of the group number of used bytes (1..8) at p, which has 8
+// bytes readable, as codec::decodeCompressed sums it: the first byte the
+// highest group, each byte's upper seven bits a group.  Gathered from one
+// word rather than byte by byte, since used changes from row to row and a
+// loop on it is a guess the processor often gets wrong.
 inline uint64_t groupValue(const unsigned char* p, uint32_t used) {
+#if defined(__BYTE_ORDER__) && __BYTE_ORDER__ == __ORDER_LITTLE_ENDIAN__
+    uint64_t word;
+    std::memcpy(&word, p, 8);
+    // The used bytes, the first the highest, in the low bytes of x.
+    uint64_t x = __builtin_bswap64(word) >> (8 * (8 - used));
+    x = (x >> 1) & 0x7F7F7F7F7F7F7F7Full;
+    // Groups of 7 bits packed to 14 in 16-bit lanes, 28 in 32, 56 in all.
+    x = (x & 0x007F007F007F007Full) | ((x & 0x7F007F007F007F00ull) >> 1);
+    x = (x & 0x00003FFF00003FFFull) | ((x & 0x3FFF00003FFF0000ull) >> 2);
+    x = (x & 0x000000000FFFFFFFull) | ((x & 0x0FFFFFFF00000000ull) >> 4);
+    return x;
+#else
     uint64_t v = 0;
     for (uint32_t k = 0; k < used; ++k) v = (v << 7) | (p[k] >> 1);
     return v;
+#endif
 }
 
 }  // namespace
@@ -1107,12 +1119,12 @@ int FS_Table::peekGuardColumn(size_t k) {
     return peekGuardColumns[k].second;
 }
 
-inline bool FS_Table::peekedBucketOf(PeekedColumn& c, bool text, const unsigned char* bytes, const uint32_t* upper,
-                                     int* bucket) {
+inline bool FS_Table::peekedBucketOf(PeekedColumn& c, bool text, const unsigned char* bytes, uint32_t readable,
+                                     const uint32_t* upper, int* bucket) {
     if (text) {
         if (c.ascii == 0) return false;
         bool plain = false;
-        *bucket = hashUpperAscii(bytes + c.at, c.length, upper, &plain);
+        *bucket = hashUpperAscii(bytes + c.at, c.length, readable - c.at, upper, upperAsciiWords, &plain);
         c.ascii = plain ? 1 : 0;
         return plain;
     }
@@ -1126,10 +1138,10 @@ inline bool FS_Table::peekedBucketOf(PeekedColumn& c, bool text, const unsigned 
     return true;
 }
 
-bool FS_Table::peekedBucket(unsigned int column, const unsigned char* bytes, int* bucket) {
+bool FS_Table::peekedBucket(unsigned int column, const unsigned char* bytes, uint32_t readable, int* bucket) {
     unsigned int type = schema.at(column)->getType();
     if (type != FIELD_TEXT && (type < FIELD_INT8 || type > FIELD_INT64)) return false;
-    return peekedBucketOf(peekColumns[column], type == FIELD_TEXT, bytes, upperAsciiTable(), bucket);
+    return peekedBucketOf(peekColumns[column], type == FIELD_TEXT, bytes, readable, upperAsciiTable(), bucket);
 }
 
 bool FS_Table::peekPassesGuard(unsigned int id, uint32_t end) {
@@ -1142,7 +1154,8 @@ bool FS_Table::peekPassesGuard(unsigned int id, uint32_t end) {
         int column = peekGuardColumn(static_cast<size_t>(&entry - guard->indexes.data()));
         if (column < 0) continue;
         int bucket = -1;
-        if (!peekedBucket(static_cast<unsigned int>(column), peekBytes.data(), &bucket)) return false;
+        if (!peekedBucket(static_cast<unsigned int>(column), peekBytes.data(), static_cast<uint32_t>(peekBytes.size()), &bucket))
+            return false;
         // A key that is not where its record is filed is damage whichever
         // read meets it; the guarded read that follows finds it noted.
         if (bucket >= 0 && !guardFiled(entry, id, static_cast<uint32_t>(bucket))) return false;
@@ -1308,7 +1321,9 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
         for (unsigned int k = 0; k < keys; ++k) {
             if (guard->reachedIndex == keyEntry[k]->index && guard->reachedId == n) return;
             int bucket = -1;
-            if (!peekedBucketOf(peekColumns[keyColumn[k]], keyText[k], record, upper, &bucket)) return;
+            if (!peekedBucketOf(peekColumns[keyColumn[k]], keyText[k], record, windowHave - (offset - windowStart), upper,
+                                &bucket))
+                return;
             if (!keyEntry[k]->holds(n, static_cast<uint32_t>(bucket))) return;
         }
         PeekedColumn& text = peekColumns[column];
@@ -1543,6 +1558,10 @@ const uint32_t* FS_Table::upperAsciiTable() {
     if (!upperAsciiReady) {
         for (unsigned int b = 0; b < 256; ++b)
             upperAscii[b] = b != 0 && b < 128 ? static_cast<uint32_t>(std::towupper(static_cast<wint_t>(b))) : kNotPlainAscii;
+        // Eight bytes at a time where the locale upper-cases ASCII as C does.
+        upperAsciiWords = keyhash::kWordsServe;
+        for (unsigned int b = 1; b < 128; ++b)
+            if (upperAscii[b] != (b >= 'a' && b <= 'z' ? b - 0x20 : b)) upperAsciiWords = false;
         upperAsciiReady = true;
     }
     return upperAscii;

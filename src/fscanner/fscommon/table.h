@@ -436,18 +436,21 @@ private:
     std::vector<std::pair<Index*, int>> peekGuardColumns;
     int peekGuardColumn(size_t k);
     // The bucket of the key a peeked column holds (bytes as given to
-    // decodePeeked); false where only the full read can tell (text that is
-    // not plain ASCII).
-    bool peekedBucket(unsigned int column, const unsigned char* bytes, int* bucket);
+    // decodePeeked, readable of them); false where only the full read can
+    // tell (text that is not plain ASCII).
+    bool peekedBucket(unsigned int column, const unsigned char* bytes, uint32_t readable, int* bucket);
     // The same for a column whose kind the caller knows (text, or one of the
     // integer types), with the table of upperAsciiTable().
-    bool peekedBucketOf(PeekedColumn& c, bool text, const unsigned char* bytes, const uint32_t* upper,
-                        int* bucket);
+    bool peekedBucketOf(PeekedColumn& c, bool text, const unsigned char* bytes, uint32_t readable,
+                        const uint32_t* upper, int* bucket);
     // towupper of each ASCII code 1..127, for the index keys of peeked text
     // and of inserted text; 0 and 128..255, which no plain ASCII text holds,
     // have a mark no upper case has (kNotPlainAscii).  Filled at first use.
     uint32_t upperAscii[256];
     bool upperAsciiReady = false;
+    // The table upper-cases a..z and keeps every other plain byte, so
+    // peeked keys are hashed eight bytes at a time (keyhash.h).
+    bool upperAsciiWords = false;
     const uint32_t* upperAsciiTable();
     // The bucket of text's key: hash() of text upper-cased as wcsupper does,
     // without a copy of the text.
