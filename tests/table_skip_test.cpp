@@ -410,11 +410,13 @@ TEST(TableSkipWideKey, AKeyStoredWiderThanItsColumnIsCutAsTheFullReadCutsIt) {
     EXPECT_EQ(rowByRow.back(), "sound");
 }
 
-// A compressed 64-bit key of every stored length, one byte to ten: the rows
-// skipRejected passes over find each key's value in the bytes as the full
-// read does (a number of up to eight bytes gathered in one step, a longer
-// one left to the full decoder), or their keys would not be where the index
-// files them and every row would be decided one by one.
+// A compressed 64-bit key of every stored length, one byte to ten, behind a
+// run of two other numbers of every length: the rows skipRejected passes
+// over find each key's value in the bytes as the full read does (a number of
+// up to eight bytes gathered in one step, a longer one left to the full
+// decoder; a run stepped over at once where it fits eight bytes, number by
+// number where not), or their keys would not be where the index files them
+// and every row would be decided one by one.
 TEST(TableSkipKeyLengths, AKeyOfEveryStoredLengthIsReadAsTheFullReadReadsIt) {
     testsupport::TempDir dir, locks;
     char saved[sizeof LinuxSharedMutex::storePath];
@@ -432,6 +434,8 @@ TEST(TableSkipKeyLengths, AKeyOfEveryStoredLengthIsReadAsTheFullReadReadsIt) {
     {
         FS_Table t(L"lengths", wdir.c_str(), true);
         t.addField(L"NAME", FIELD_TEXT);
+        t.addField(L"FIRST", FIELD_INT64);
+        t.addField(L"SECOND", FIELD_INT64);
         t.addField(L"KEY", FIELD_INT64);
         ASSERT_TRUE(t.create());
         ASSERT_TRUE(t.addHashIndex(L"lengths_KEY", L"KEY"));
@@ -439,7 +443,9 @@ TEST(TableSkipKeyLengths, AKeyOfEveryStoredLengthIsReadAsTheFullReadReadsIt) {
             Fields rec(t.getFields());
             std::wstring name = L"n" + std::to_wstring(i) + (i % 10 == 9 ? L".c" : L".h");
             static_cast<TextField*>(rec.at(0))->value(name.c_str());
-            static_cast<Int64Field*>(rec.at(1))->value(values[i % values.size()]);
+            static_cast<Int64Field*>(rec.at(1))->value(values[(i / 3) % values.size()]);
+            static_cast<Int64Field*>(rec.at(2))->value(values[(i * 7) % values.size()]);
+            static_cast<Int64Field*>(rec.at(3))->value(values[i % values.size()]);
             ASSERT_TRUE(t.insert(rec));
         }
         t.close();
@@ -468,7 +474,9 @@ TEST(TableSkipKeyLengths, AKeyOfEveryStoredLengthIsReadAsTheFullReadReadsIt) {
                     break;
                 }
                 rows.push_back(narrow(static_cast<TextField*>(rec.at(0))->value()) + " " +
-                               std::to_string(static_cast<Int64Field*>(rec.at(1))->value()));
+                               std::to_string(static_cast<Int64Field*>(rec.at(1))->value()) + " " +
+                               std::to_string(static_cast<Int64Field*>(rec.at(2))->value()) + " " +
+                               std::to_string(static_cast<Int64Field*>(rec.at(3))->value()));
             }
             if (skip) t.skipRejected(id, 0, notDotC, nullptr, &wanted);
         }

@@ -984,6 +984,24 @@ inline uint32_t groupLength8(const unsigned char* p) {
 #endif
 }
 
+// The bytes of the count group numbers at p, which has 8 bytes readable,
+// when all of them end in those 8 bytes; 0 otherwise (and for count 0).
+inline uint32_t groupsLength8(const unsigned char* p, uint32_t count) {
+#if defined(__BYTE_ORDER__) && __BYTE_ORDER__ == __ORDER_LITTLE_ENDIAN__
+    if (count == 0 || count > 8) return 0;
+    uint64_t word;
+    std::memcpy(&word, p, 8);
+    uint64_t ends = ~word & 0x0101010101010101ull;
+    // The last bytes of the numbers before the last one dropped.
+    for (uint32_t k = 1; k < count; ++k) ends &= ends - 1;
+    return ends == 0 ? 0 : static_cast<uint32_t>(__builtin_ctzll(ends)) / 8 + 1;
+#else
+    (void)p;
+    (void)count;
+    return 0;
+#endif
+}
+
 // The value of the group number of used bytes (1..8) at p, which has 8
 // bytes readable, as codec::decodeCompressed sums it: the first byte the
 // highest group, each byte's upper seven bits a group.  Gathered from one
@@ -1024,8 +1042,16 @@ bool FS_Table::skimRow(const unsigned char* bytes, uint32_t available, const Ski
             case SKIM_NUMBERS: {
                 // Each number's eight bytes are readable.
                 if (left < 8u * step.n) return false;
+                // Most runs fit one word: the run ends at the step.n-th last
+                // byte in it.  Found so, the run costs one load; number by
+                // number, each load waits for the length of the one before.
+                uint32_t used = groupsLength8(p, step.n);
+                if (used != 0) {
+                    p += used;
+                    break;
+                }
                 for (unsigned int k = 0; k < step.n; ++k) {
-                    uint32_t used = groupLength8(p);
+                    used = groupLength8(p);
                     if (used == 0) return false;
                     p += used;
                 }
