@@ -297,6 +297,124 @@ TEST_F(LookupTest, PathByIdAnswersFromTheMemoAndFlushesItWhenFull)
     EXPECT_EQ(L"<false:>", byId(3));  // forgotten, and the rows are gone
 }
 
+// The memo's keys and texts, in key order.
+std::wstring memoOf(const FS_Cache& cache)
+{
+    std::wstring out;
+    for (const auto& entry : cache.pathMemo)
+        out += std::to_wstring(entry.first) + L"=" + entry.second.text + L"<" +
+               std::to_wstring(entry.second.parentId) + L" ";
+    return out;
+}
+
+// A walk that goes on from the last one answers, and leaves the memo, as the
+// walk alone does after every step: over a deep tree visited in the order of
+// a scan and out of it, with flushes of the memo in the middle of walks,
+// buffers too small, rows gone that the memo still knows, an empty
+// component and ids that do not exist.
+TEST_F(LookupTest, PathByIdAlongTheLastWalkAnswersAndFillsTheMemoAsTheWalkAlone)
+{
+    std::vector<unsigned int> order;  // the order of a scan
+    auto removeRows = [&]() {
+        RecordSet rs = cache->tbDirectories->openRecordSet();
+        for (bool row = rs.moveFirst(); row; row = rs.moveNext())
+            rs.remove();
+        cache->tbDirectories->closeRecordSet(rs);
+    };
+    // Three branches of 12 levels, each level with two leaves beside it.
+    auto plant = [&]() {
+        removeRows();
+        order.clear();
+        addDir(1, L"/", 0);
+        unsigned int next = 2;
+        for (int branch = 0; branch < 3; ++branch) {
+            unsigned int parent = 1;
+            for (int level = 0; level < 12; ++level) {
+                unsigned int id = next++;
+                addDir(id, (L"b" + std::to_wstring(branch) + L"l" + std::to_wstring(level)).c_str(), parent);
+                order.push_back(id);
+                for (int leaf = 0; leaf < 2; ++leaf) {
+                    unsigned int leafId = next++;
+                    addDir(leafId, (level == 5 && leaf == 1 ? L"" : L"leaf" + std::to_wstring(leaf)).c_str(), id);
+                    order.push_back(leafId);
+                }
+                parent = id;
+            }
+        }
+    };
+    plant();
+    std::vector<std::pair<unsigned int, unsigned int>> calls;  // id, buffer size
+    for (unsigned int id : order)
+        calls.push_back({id, 4096});
+    // Walks of others in between, without the last walk (a size of 4095
+    // marks them): they flush the memo under the last walk's chain.
+    calls.push_back({order[20], 4096});
+    calls.push_back({order[order.size() - 1], 4095});
+    calls.push_back({order[order.size() - 40], 4095});
+    calls.push_back({order[22], 4096});
+    calls.push_back({order[25], 4096});
+    // The memo emptied under a chain that holds (a size of 4094 marks it).
+    calls.push_back({order[27], 4096});
+    calls.push_back({order[28], 4096});
+    calls.push_back({0, 4094});
+    calls.push_back({order[29], 4096});
+    // Back and forth across the branches, an id that is not there, the root.
+    for (unsigned int i = 0; i < order.size(); i += 7)
+        calls.push_back({order[order.size() - 1 - i], 4096});
+    calls.push_back({999, 4096});
+    calls.push_back({1, 4096});
+    // Buffers the path does not fit, by one, and that it just fits.
+    for (unsigned int i = 0; i + 2 < order.size(); i += 9) {
+        std::wstring full = byId(order[i]);
+        calls.push_back({order[i + 1], 4096});
+        calls.push_back({order[i], static_cast<unsigned int>(full.size() + 3)});
+        calls.push_back({order[i + 2], 4096});
+        calls.push_back({order[i], static_cast<unsigned int>(full.size() + 4)});
+    }
+    cache->clearPathMemo();
+
+    auto run = [&](bool along, bool rowsGo) {
+        std::vector<std::wstring> seen;
+        FS_CacheBase::PathChain chain;
+        plant();
+        for (size_t c = 0; c < calls.size(); ++c) {
+            // The rows go; the memo, and what it knows, stays.
+            if (rowsGo && c == order.size())
+                removeRows();
+            if (calls[c].second == 4094) {
+                cache->clearPathMemo();
+                seen.push_back(L"cleared");
+                continue;
+            }
+            std::vector<wchar_t> buffer(calls[c].second + 1, L'#');
+            bool found = along && calls[c].second != 4095
+                             ? cache->findPathByIdAlong(first, calls[c].first, buffer.data(), calls[c].second, &chain)
+                             : cache->findPathById(first, calls[c].first, buffer.data(), calls[c].second);
+            seen.push_back(std::to_wstring(calls[c].first) + (found ? L" " : L" <false> ") + buffer.data() + L" | " +
+                           memoOf(*cache));
+        }
+        cache->clearPathMemo();
+        return seen;
+    };
+    std::vector<std::wstring> alone = run(false, false);
+    std::vector<std::wstring> along = run(true, false);
+    ASSERT_EQ(alone.size(), along.size());
+    for (size_t i = 0; i < alone.size(); ++i)
+        EXPECT_EQ(alone[i], along[i]) << "call " << i;
+    // The deepest path is whole, and some walks failed on their buffer.
+    EXPECT_NE(std::wstring::npos, alone[33].find(L"/b0l0/b0l1/b0l2/b0l3/b0l4/b0l5/b0l6/b0l7/b0l8/b0l9/b0l10/b0l11 "));
+    size_t failures = 0;
+    for (const std::wstring& line : alone)
+        failures += line.find(L"<false>") != std::wstring::npos ? 1 : 0;
+    EXPECT_GE(failures, 5u);
+
+    std::vector<std::wstring> aloneGone = run(false, true);
+    std::vector<std::wstring> alongGone = run(true, true);
+    ASSERT_EQ(aloneGone.size(), alongGone.size());
+    for (size_t i = 0; i < aloneGone.size(); ++i)
+        EXPECT_EQ(aloneGone[i], alongGone[i]) << "call " << i;
+}
+
 TEST_F(LookupTest, RemoveTreeTakesRowsBelowAndTheirFilesAndKeepsParents)
 {
     standardTree();

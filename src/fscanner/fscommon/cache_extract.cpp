@@ -130,6 +130,8 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
     const unsigned int colQ32 = position(L"Q32");
 
     PathHelper pathHelper(1);
+    // The walk up to the last directory: the next one's mostly ends on it.
+    PathChain lastWalk;
     unsigned int lastDirectoryId = 0;
     bool includeFile = false;
     int lastRootIndex = -1;
@@ -150,7 +152,7 @@ int FS_CacheBase::extractResults(FsResultSetWriter& writer, wchar_t const* query
             // directory: a row costs nothing beyond the time check.
             CpuThreshold::doIteration();
             FS_TRACE_AS(log, MAX, "%s::%s bIncludeFile=false");
-            if (!findPathById(directories, pathId, directoryPath, EXTRACT_PATH_CHARS)) {
+            if (!findPathByIdAlong(directories, pathId, directoryPath, EXTRACT_PATH_CHARS, &lastWalk)) {
                 FS_TRACE(log, MIN, "findPathById() failed! extract interrupted!");
                 return CACHE_UNUSABLE;
             }

@@ -173,7 +173,7 @@ FS_CacheBase::FS_CacheBase(wchar_t const* directoriesTable, wchar_t const* files
       mutexName(nullptr), directoriesIndex(0), cacheInitialized(false), cacheOpened(false),
       cacheUnusable(false), tableFlag(tableFlag_), cacheChecker(cacheChecker_),
       narrowPathBuffer(nullptr), narrowPathBufferSize(0), wideNameBuffer(nullptr),
-      wideNameBufferSize(0), defaultVariables(nullptr), criteria(), exHashFileName(nullptr),
+      pathMemoEdits(0), defaultVariables(nullptr), criteria(), exHashFileName(nullptr),
       providerHash(providerName), firstQuery(true), pathsChanged(true), fileSystemsChanged(true),
       className("FS_CacheBase"), log(nullptr), knownHashes(glue->knownHashes),
       checksumFlags(glue->checksumFlags), reserved(glue->reserved),

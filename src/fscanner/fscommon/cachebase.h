@@ -195,6 +195,34 @@ public:
     // Full path of directory id into buffer (size in wide characters); false
     // on a broken chain, id 0 or a buffer too small.
     bool findPathById(RecordSet& directories, unsigned int id, wchar_t* buffer, unsigned int size);
+    // The last walk of findPathByIdAlong, root first: the directory ids of
+    // its path, where each one's component ends in text, and whether a
+    // separator follows the component when a deeper one does.  The next
+    // directory of an extraction mostly shares all but the last few
+    // components: from the deepest id the two walks share, the path is the
+    // text's up to there, as the memo would give it again component by
+    // component.
+    struct PathChain {
+        struct Step {
+            unsigned int id;
+            size_t end;
+            bool separatorAfter;
+        };
+        std::vector<Step> steps;
+        std::wstring text;
+        // The steps of the walk under way, leaf first, each end still where
+        // it is in the buffer the walk builds in.
+        std::vector<Step> fresh;
+        size_t edits = 0;  // pathMemoEdits when the walk ended
+        bool valid = false;
+    };
+    // findPathById, answering from chain (null: none) where the walk meets
+    // it and keeping the walk there for the next call.  The memo is looked
+    // at and filled exactly as findPathById does: the chain answers only
+    // for ids the memo holds as they were, and goes whenever an entry of it
+    // goes.
+    bool findPathByIdAlong(RecordSet& directories, unsigned int id, wchar_t* buffer, unsigned int size,
+                           PathChain* chain);
     // Removes every file row of directory pathId.
     void removeFiles(FS_Table* files, unsigned int pathId);
     // Removes the directory id, every row below it and their files.
@@ -260,7 +288,10 @@ public:
     // No longer used by the scan, which decodes names into its walker; kept
     // so that the object's layout stays as it was.
     wchar_t* wideNameBuffer;
-    size_t wideNameBufferSize;
+    // Counts the entries dropped from pathMemo or replaced in it (in the
+    // place of the buffer's size, which it no longer has): a walk kept from
+    // before holds only while no entry it answered from has gone.
+    size_t pathMemoEdits;
     // Directory id -> component and parent id, of the ids walked last.
     std::map<int, MapItem> pathMemo;
     Fields* defaultVariables;

@@ -341,10 +341,17 @@ void FS_CacheBase::clearPathMemo()
     for (std::map<int, MapItem>::iterator it = pathMemo.begin(); it != pathMemo.end(); ++it)
         kelm_free(it->second.text);
     pathMemo.clear();
+    ++pathMemoEdits;
 }
 
 bool FS_CacheBase::findPathById(RecordSet& directories, unsigned int id, wchar_t* buffer,
                                 unsigned int size)
+{
+    return findPathByIdAlong(directories, id, buffer, size, nullptr);
+}
+
+bool FS_CacheBase::findPathByIdAlong(RecordSet& directories, unsigned int id, wchar_t* buffer,
+                                     unsigned int size, PathChain* chain)
 {
     if (buffer == nullptr || size == 0)
         return false;
@@ -365,8 +372,36 @@ bool FS_CacheBase::findPathById(RecordSet& directories, unsigned int id, wchar_t
         return true;
     };
     const wchar_t separator = PathHelper::PathSeparator;
+    // The last walk answers only while every memo entry it came from is
+    // still there; an entry dropped during this walk spoils this one too.
+    const size_t editsBefore = pathMemoEdits;
+    bool chainHolds = chain != nullptr && chain->valid && chain->edits == pathMemoEdits;
+    size_t kept = 0;  // steps of the last walk this one ends on
+    if (chain != nullptr)
+        chain->fresh.clear();
     unsigned int current = id;
     while (current != 0) {
+        if (chainHolds) {
+            size_t k = chain->steps.size();
+            while (k > 0 && chain->steps[k - 1].id != current)
+                --k;
+            if (k > 0) {
+                // From here up the memo holds every id of the last walk, and
+                // the walk would prepend their components one by one; each
+                // prepend is refused only where the whole would be.
+                const PathChain::Step& met = chain->steps[k - 1];
+                bool failed = length != 0 && met.separatorAfter && !prepend(&separator, 1);
+                if (!failed)
+                    failed = !prepend(chain->text.data(), met.end);
+                if (failed) {
+                    buffer[0] = L'\0';
+                    chain->valid = false;
+                    return false;
+                }
+                kept = k;
+                break;
+            }
+        }
         bool failed = false;
         wchar_t* component = nullptr;
         unsigned int parent = 0;
@@ -384,8 +419,10 @@ bool FS_CacheBase::findPathById(RecordSet& directories, unsigned int id, wchar_t
             // which the walk is about to climb: rows arrive grouped by
             // directory and directories in the order of the scan, so the
             // ancestors are what the next rows need again.
-            if (pathMemo.size() > cachetables::MEMO_ENTRIES)
+            if (pathMemo.size() > cachetables::MEMO_ENTRIES) {
                 keepMemoChain(pathMemo, parent);
+                ++pathMemoEdits;
+            }
             // A component longer than the limit is cut; the prepend below
             // then refuses the path as too long for any buffer.
             size_t room = cachetables::MEMO_TEXT_BYTES / sizeof(wchar_t) - 1;
@@ -408,27 +445,52 @@ bool FS_CacheBase::findPathById(RecordSet& directories, unsigned int id, wchar_t
                 if (old != pathMemo.end()) {
                     kelm_free(old->second.text);
                     pathMemo.erase(old);
+                    ++pathMemoEdits;
                 }
                 pathMemo[key] = item;
             }
         }
+        if (pathMemoEdits != editsBefore)
+            chainHolds = false;
         if (!failed && component == nullptr)
             failed = true;
         if (!failed) {
             size_t n = wcslen(component);
-            if (length != 0 && (n == 0 || component[n - 1] != PathHelper::PathSeparator))
+            bool separatorAfter = n == 0 || component[n - 1] != PathHelper::PathSeparator;
+            if (length != 0 && separatorAfter)
                 failed = !prepend(&separator, 1);
             if (!failed)
                 failed = !prepend(component, n);
+            if (!failed && chain != nullptr)
+                chain->fresh.push_back(PathChain::Step{current, start + n, separatorAfter});
         }
         if (failed) {
             // current is never 0 inside the loop: a broken walk is a failure.
             buffer[0] = L'\0';
+            if (chain != nullptr)
+                chain->valid = false;
             return false;
         }
         current = parent;
     }
     wmemmove(buffer, buffer + start, length + 1);
+    if (chain != nullptr) {
+        // This walk for the next: the steps it met of the last one, then its
+        // own, root first, each ending where its component ends now.
+        if (pathMemoEdits != editsBefore) {
+            chain->valid = false;
+        } else {
+            chain->steps.resize(kept);
+            for (size_t i = chain->fresh.size(); i-- > 0;) {
+                PathChain::Step step = chain->fresh[i];
+                step.end -= start;
+                chain->steps.push_back(step);
+            }
+            chain->text.assign(buffer, length);
+            chain->edits = pathMemoEdits;
+            chain->valid = true;
+        }
+    }
     return length != 0;
 }
 
