@@ -497,4 +497,88 @@ TEST(TableSkipKeyLengths, AKeyOfEveryStoredLengthIsReadAsTheFullReadReadsIt) {
     EXPECT_EQ(rowByRow.back(), "sound");
 }
 
+// The skipping walk over one column, then another, of the same open table,
+// and again after the table is opened anew on files whose columns stand in
+// another order (the filtered column and the key where they were): each
+// walk skims the rows for its own columns, not for those of the walk before,
+// and passes over every row it turns away.
+TEST(TableSkipColumns, EachWalkSkimsForItsOwnColumns) {
+    testsupport::TempDir dir, locks;
+    char saved[sizeof LinuxSharedMutex::storePath];
+    std::memcpy(saved, LinuxSharedMutex::storePath, sizeof saved);
+    ASSERT_TRUE(LinuxSharedMutex::setStorePath(locks.path().c_str()));
+    std::wstring wdir = wide(dir.path() + "/");
+    const unsigned int kRows = 90;
+    // NAME ends in ".c" on every 10th row, OTHER on every 7th; the number
+    // between them is long enough to move OTHER when it is not stepped over.
+    auto make = [&](bool otherSecond) {
+        FS_Table t(L"cols", wdir.c_str(), true);
+        t.erase();
+        t.addField(L"NAME", FIELD_TEXT);
+        if (otherSecond) t.addField(L"OTHER", FIELD_TEXT);
+        t.addField(L"NUMBER", FIELD_INT64);
+        if (!otherSecond) t.addField(L"OTHER", FIELD_TEXT);
+        ASSERT_TRUE(t.create());
+        ASSERT_TRUE(t.addHashIndex(L"cols_NAME", L"NAME"));
+        for (unsigned int i = 0; i < kRows; ++i) {
+            Fields rec(t.getFields());
+            std::wstring name = L"n" + std::to_wstring(i) + (i % 10 == 9 ? L".c" : L".h");
+            std::wstring other = L"o" + std::to_wstring(i * 31) + (i % 7 == 3 ? L".c" : L".txt");
+            static_cast<TextField*>(rec.at(rec.indexOf(L"NAME")))->value(name.c_str());
+            static_cast<TextField*>(rec.at(rec.indexOf(L"OTHER")))->value(other.c_str());
+            static_cast<Int64Field*>(rec.at(rec.indexOf(L"NUMBER")))->value(1ull << (i % 60));
+            ASSERT_TRUE(t.insert(rec));
+        }
+        t.close();
+    };
+    // The rows a walk over column reads, one table object for every walk.
+    FS_Table t(L"cols", wdir.c_str(), true);
+    unsigned int decided = 0;  // rows of the last walk decided one by one
+    auto walk = [&](const wchar_t* columnName, bool skip) {
+        std::vector<std::string> rows;
+        decided = 0;
+        unsigned int column = static_cast<unsigned int>(t.getFields().indexOf(columnName));
+        unsigned int id = 0;
+        unsigned int wanted = FS_Table::kNoRow;
+        for (bool row = t.moveFirst(id); row; row = t.moveNext(id)) {
+            bool turnedAway = false;
+            if (!(skip && id == wanted)) {
+                ++decided;
+                const unsigned char* text = nullptr;
+                uint32_t length = 0;
+                bool ascii = false;
+                turnedAway = t.peekText(id, column, &text, &length, &ascii) && ascii && notDotC(nullptr, text, length);
+            }
+            if (!turnedAway) {
+                Fields rec(t.getFields());
+                if (!t.read(id, rec)) {
+                    rows.push_back(std::to_string(id) + " read failed");
+                    break;
+                }
+                rows.push_back(narrow(static_cast<TextField*>(rec.at(column))->value()));
+            }
+            if (skip) t.skipRejected(id, column, notDotC, nullptr, &wanted);
+        }
+        rows.push_back(t.isDamaged() ? std::string("damaged: ") + t.damagedCheck() : "sound");
+        return rows;
+    };
+    for (bool otherSecond : {false, true}) {
+        make(otherSecond);
+        // One opening for all the walks of a table.
+        ASSERT_TRUE(t.open());
+        ASSERT_TRUE(t.verify());
+        for (const wchar_t* column : {L"NAME", L"OTHER", L"NAME"}) {
+            std::vector<std::string> rowByRow = walk(column, false);
+            std::vector<std::string> skipping = walk(column, true);
+            std::string where = narrow(column) + (otherSecond ? ", OTHER second" : ", OTHER last");
+            EXPECT_EQ(rowByRow, skipping) << where;
+            EXPECT_EQ(rowByRow.size(), std::wstring(column) == L"NAME" ? kRows / 10 + 1 : kRows / 7 + 2) << where;
+            // Only the first row, read before the walk skips, one by one.
+            EXPECT_EQ(decided, 1u) << where;
+        }
+        t.close();
+    }
+    std::memcpy(LinuxSharedMutex::storePath, saved, sizeof saved);
+}
+
 }  // namespace

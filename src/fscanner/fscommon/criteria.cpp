@@ -138,35 +138,6 @@ bool NameMaskFilter::mayMatch(const unsigned char* text, size_t length, bool cas
     return mayMatchAscii(text, length, caseSensitive);
 }
 
-bool NameMaskFilter::endsWithTail(Node const& n, const unsigned char* text, size_t length,
-                                  bool caseSensitive) const {
-    // The matcher tries the tail at every start in turn and takes one that
-    // ends with the text: a suffix test.
-    size_t tail = n.mask.size() - 1;
-    if (length < tail) return false;
-    const unsigned char* p = reinterpret_cast<const unsigned char*>(n.mask.data()) + 1;
-    const unsigned char* t = text + (length - tail);
-    // Every byte of a short tail is compared, without a stop at the first
-    // difference: where that comes changes from name to name, and the
-    // processor's guess at it costs more than the few compares.
-    unsigned int differ = 0;
-    if (caseSensitive) {
-        for (size_t i = 0; i < tail; ++i) differ |= static_cast<unsigned int>(p[i] ^ t[i]);
-    } else {
-        for (size_t i = 0; i < tail; ++i) differ |= static_cast<unsigned int>(fold.lower[p[i]] ^ fold.lower[t[i]]);
-    }
-    return differ == 0;
-}
-
-bool NameMaskFilter::mayMatchAscii(const unsigned char* text, size_t length, bool caseSensitive) const {
-    if (root < 0 || text == nullptr) return true;
-    // The usual query, "*.ext" alone, without the walk over the nodes: it
-    // runs once for every row of a table.
-    Node const& top = nodes[static_cast<size_t>(root)];
-    if (top.kind == MASK && top.suffixOnly) return endsWithTail(top, text, length, caseSensitive);
-    return evaluate(root, text, length, caseSensitive) != FALSE_QUIET;
-}
-
 // ---------------------------------------------------------------- CriteriaEvaluator
 
 CriteriaEvaluator::CriteriaEvaluator(wchar_t const* text)

@@ -48,8 +48,15 @@ public:
     // False when a row whose column holds [text, text + length) can not
     // satisfy the expression; true when it may.
     bool mayMatch(const unsigned char* text, size_t length, bool caseSensitive) const;
-    // The same for a text known to be plain ASCII.
-    bool mayMatchAscii(const unsigned char* text, size_t length, bool caseSensitive) const;
+    // The same for a text known to be plain ASCII.  Inline: a walk over a
+    // table asks it for every row.
+    bool mayMatchAscii(const unsigned char* text, size_t length, bool caseSensitive) const {
+        if (root < 0 || text == nullptr) return true;
+        // The usual query, "*.ext" alone, without the walk over the nodes.
+        Node const& top = nodes[static_cast<size_t>(root)];
+        if (top.kind == MASK && top.suffixOnly) return endsWithTail(top, text, length, caseSensitive);
+        return evaluate(root, text, length, caseSensitive) != FALSE_QUIET;
+    }
     // True when the expression is the one mask comparison: on a plain ASCII
     // text the byte matcher answers as the evaluator does, so mayMatchAscii
     // is then the expression's verdict, not only a bound on it.
@@ -72,7 +79,24 @@ private:
     int add(TreeNode* node, Fields* fields, unsigned int depth);
     Outcome evaluate(int node, const unsigned char* text, size_t length, bool caseSensitive) const;
     // A suffixOnly MASK's answer: whether the text ends in the mask's tail.
-    bool endsWithTail(Node const& n, const unsigned char* text, size_t length, bool caseSensitive) const;
+    bool endsWithTail(Node const& n, const unsigned char* text, size_t length, bool caseSensitive) const {
+        // The matcher tries the tail at every start in turn and takes one
+        // that ends with the text: a suffix test.
+        size_t tail = n.mask.size() - 1;
+        if (length < tail) return false;
+        const unsigned char* p = reinterpret_cast<const unsigned char*>(n.mask.data()) + 1;
+        const unsigned char* t = text + (length - tail);
+        // Every byte of a short tail is compared, without a stop at the
+        // first difference: where that comes changes from name to name, and
+        // the processor's guess at it costs more than the few compares.
+        unsigned int differ = 0;
+        if (caseSensitive) {
+            for (size_t i = 0; i < tail; ++i) differ |= static_cast<unsigned int>(p[i] ^ t[i]);
+        } else {
+            for (size_t i = 0; i < tail; ++i) differ |= static_cast<unsigned int>(fold.lower[p[i]] ^ fold.lower[t[i]]);
+        }
+        return differ == 0;
+    }
 
     std::vector<Node> nodes;
     int root = -1;

@@ -386,6 +386,7 @@ bool FS_Table::growScratch(unsigned int characters) {
 
 bool FS_Table::addField(wchar_t const* fieldName, unsigned int type) {
     if (dataFile != nullptr || pointerFile != nullptr) return false;
+    lastSkim.built = false;
     return schema.add(fieldName, type);
 }
 
@@ -426,6 +427,8 @@ bool FS_Table::create() {
 bool FS_Table::open() {
     if (dataPath == nullptr || pointerPath == nullptr) return false;
     if (dataFile != nullptr || pointerFile != nullptr) return false;
+    // The columns may change below.
+    lastSkim.built = false;
     dataFile = SysFactory::createMmFile(dataPath);
     pointerFile = SysFactory::createMmFile(pointerPath);
     if (dataFile == nullptr || pointerFile == nullptr || !dataFile->open() || !pointerFile->open()) {
@@ -470,6 +473,7 @@ bool FS_Table::close() {
     // A cursor never outlives the open table it walks.
     deleteRecordSets();
     schema.removeAll();
+    lastSkim.built = false;
     dropGuard();
     return true;
 }
@@ -1237,7 +1241,7 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
     // an index not yet checked whole is for the reads to check.
     // The buckets are found as peekedBucket finds them, the column's kind
     // looked up once here instead of at every row.
-    const unsigned int kMostKeys = 16;
+    const unsigned int kMostKeys = SkimProgram::kMostKeys;
     TableGuard::IndexBuckets* keyEntry[kMostKeys];
     unsigned int keyColumn[kMostKeys];
     bool keyText[kMostKeys];
@@ -1259,12 +1263,26 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
     // The rows are skimmed where they can be: only the keys and the
     // filtered text are decoded.
     if (peekColumns.size() < count) peekColumns.resize(count);
-    bool looked[kMaxFields] = {};
-    looked[column] = true;
-    for (unsigned int k = 0; k < keys; ++k) looked[keyColumn[k]] = true;
-    SkimStep steps[kMaxFields];
-    unsigned int stepCount = 0;
-    bool skim = buildSkim(looked, steps, &stepCount);
+    // A walk asks again after every row it wants, for the same columns:
+    // the program is built once for them.
+    SkimProgram& program = lastSkim;
+    bool same = program.built && program.column == column && program.keys == keys;
+    for (unsigned int k = 0; same && k < keys; ++k) same = program.keyColumn[k] == keyColumn[k];
+    if (!same) {
+        bool looked[kMaxFields] = {};
+        looked[column] = true;
+        for (unsigned int k = 0; k < keys; ++k) looked[keyColumn[k]] = true;
+        program.column = column;
+        program.keys = keys;
+        for (unsigned int k = 0; k < keys; ++k) program.keyColumn[k] = keyColumn[k];
+        program.count = 0;
+        program.steps.resize(count);
+        program.skim = buildSkim(looked, program.steps.data(), &program.count);
+        program.built = true;
+    }
+    const SkimStep* steps = program.steps.data();
+    const unsigned int stepCount = program.count;
+    const bool skim = program.skim;
 
     // The table's files are mapped and lend their bytes in place.
     LinuxMmFile* mappedSlots = exactlyMapped(pointerFile);

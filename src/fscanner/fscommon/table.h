@@ -345,6 +345,19 @@ private:
     };
     enum : unsigned char { SKIM_NUMBERS, SKIM_BYTES, SKIM_INT8, SKIM_NUMBER, SKIM_TEXT, SKIM_PASS_TEXT };
     bool buildSkim(const bool* decoded, SkimStep* steps, unsigned int* count);
+    // The program skipRejected built last, and the filtered column and key
+    // columns it was built for (the schema of an open table stays).
+    struct SkimProgram {
+        static const unsigned int kMostKeys = 16;
+        bool built = false;
+        unsigned int column = 0;
+        unsigned int keys = 0;
+        unsigned int keyColumn[kMostKeys];
+        std::vector<SkimStep> steps;  // one a column at most
+        unsigned int count = 0;
+        bool skim = false;
+    };
+    SkimProgram lastSkim;
     bool skimRow(const unsigned char* bytes, uint32_t available, const SkimStep* steps, unsigned int count,
                  uint32_t* length);
     // Stores the columns the last peekRecord found into the first count
