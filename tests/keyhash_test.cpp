@@ -104,4 +104,26 @@ TEST(KeyHashTest, BytesBehindTheTextDoNotCount) {
     }
 }
 
+// A number's sum is that of its decimal text with the terminator, as the
+// index sums the text it files a number under.
+TEST(KeyHashTest, ANumberSumsAsItsDecimalText) {
+    auto textSum = [](uint32_t value) {
+        uint32_t acc = 0;
+        for (char c : std::to_string(value)) acc = acc * 37u + static_cast<unsigned char>(c);
+        return acc * 37u;
+    };
+    std::vector<uint32_t> values;
+    for (uint32_t v = 0; v < 20000; ++v) values.push_back(v);
+    for (uint32_t p = 10; p <= 1000000000u; p *= 10) {
+        values.push_back(p - 1);
+        values.push_back(p);
+        values.push_back(p + 1);
+    }
+    values.push_back(4294967295u);
+    values.push_back(4294967294u);
+    std::mt19937 random(7);
+    for (int i = 0; i < 100000; ++i) values.push_back(static_cast<uint32_t>(random()));
+    for (uint32_t v : values) ASSERT_EQ(keyhash::decimalKeySum(v), textSum(v)) << v;
+}
+
 }  // namespace

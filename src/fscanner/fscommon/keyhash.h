@@ -156,6 +156,31 @@ inline uint32_t upperSumWords(const unsigned char* text, uint32_t length, uint32
     return acc;
 }
 
+// The sum an index files a number under: that of its decimal text,
+// terminator included (acc * 37 for the terminator's zero).  Taken from the
+// lowest digit up, each digit times its power of 37, two digits a step: the
+// divisions, each waiting for the one before, are half as many.
+inline uint32_t decimalKeySum(uint32_t value) {
+    // Two digits "ab" as they add to a sum: ('0' + a) * 37 + '0' + b.
+    struct Pairs {
+        uint32_t sum[100];
+    };
+    static constexpr Pairs kPairs = [] {
+        Pairs p{};
+        for (uint32_t i = 0; i < 100; ++i) p.sum[i] = ('0' + i / 10) * 37u + ('0' + i % 10);
+        return p;
+    }();
+    uint32_t acc = 0;
+    uint32_t power = 37;  // of the lowest digit: the terminator follows it
+    while (value >= 100) {
+        acc += kPairs.sum[value % 100] * power;
+        power *= power37(2);
+        value /= 100;
+    }
+    if (value >= 10) return acc + kPairs.sum[value] * power;
+    return acc + ('0' + value) * power;
+}
+
 }  // namespace keyhash
 
 #endif

@@ -839,18 +839,7 @@ uint64_t keptByField(unsigned int type, uint64_t value) {
 }
 
 // hash() of the decimal text of value, as an index files a number.
-int hashDecimal(unsigned int value) {
-    wchar_t digits[12];
-    int n = 0;
-    do {
-        digits[n++] = static_cast<wchar_t>(L'0' + value % 10);
-        value /= 10;
-    } while (value != 0);
-    uint32_t acc = 0;
-    while (n > 0) acc = acc * 37u + static_cast<uint32_t>(digits[--n]);
-    acc = acc * 37u;  // the terminator
-    return hash(acc, static_cast<int>(Index::BUCKETS));
-}
+int hashDecimal(unsigned int value) { return hash(keyhash::decimalKeySum(value), static_cast<int>(Index::BUCKETS)); }
 
 }  // namespace
 
