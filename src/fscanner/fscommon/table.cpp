@@ -1173,8 +1173,8 @@ bool FS_Table::peekPassesGuard(unsigned int id, uint32_t end) {
         int column = peekGuardColumn(static_cast<size_t>(&entry - guard->indexes.data()));
         if (column < 0) continue;
         int bucket = -1;
-        if (!peekedBucket(static_cast<unsigned int>(column), peekBytes.data(), static_cast<uint32_t>(peekBytes.size()), &bucket))
-            return false;
+        uint32_t readable = static_cast<uint32_t>(peekBytes.size());
+        if (!peekedBucket(static_cast<unsigned int>(column), peekBytes.data(), readable, &bucket)) return false;
         // A key that is not where its record is filed is damage whichever
         // read meets it; the guarded read that follows finds it noted.
         if (bucket >= 0 && !guardFiled(entry, id, static_cast<uint32_t>(bucket))) return false;
@@ -1354,9 +1354,8 @@ void FS_Table::skipRejected(unsigned int& id, unsigned int column, TextReject re
         for (unsigned int k = 0; k < keys; ++k) {
             if (guard->reachedIndex == keyEntry[k]->index && guard->reachedId == n) return;
             int bucket = -1;
-            if (!peekedBucketOf(peekColumns[keyColumn[k]], keyText[k], record, windowHave - (offset - windowStart), upper,
-                                &bucket))
-                return;
+            uint32_t readable = windowHave - (offset - windowStart);
+            if (!peekedBucketOf(peekColumns[keyColumn[k]], keyText[k], record, readable, upper, &bucket)) return;
             if (!keyEntry[k]->holds(n, static_cast<uint32_t>(bucket))) return;
         }
         PeekedColumn& text = peekColumns[column];
