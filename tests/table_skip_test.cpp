@@ -15,7 +15,6 @@
 #include <string>
 #include <vector>
 
-#include "fscanner/fscommon/sync.h"
 #include "support/testsupport.h"
 
 namespace {
@@ -112,8 +111,7 @@ Walk openAndWalk(const std::wstring& name, const std::wstring& dir, unsigned int
 class TableSkipTest : public ::testing::TestWithParam<bool> {
 protected:
     void SetUp() override {
-        std::memcpy(savedStore, LinuxSharedMutex::storePath, sizeof savedStore);
-        ASSERT_TRUE(LinuxSharedMutex::setStorePath(locks.path().c_str()));
+        ASSERT_TRUE(locks.ok());
         wdir = wide(dir.path() + "/");
         t.reset(newTable());
         addFields(t.get());
@@ -128,10 +126,7 @@ protected:
         t->close();
         for (const char* name : kFiles) pristine[name] = testsupport::readFile(path(name));
     }
-    void TearDown() override {
-        t.reset();
-        std::memcpy(LinuxSharedMutex::storePath, savedStore, sizeof savedStore);
-    }
+    void TearDown() override { t.reset(); }
     // An open table takes its columns from the file.
     FS_Table* newTable() { return new FS_Table(L"files", wdir.c_str(), GetParam()); }
     static void addFields(FS_Table* table) {
@@ -222,10 +217,9 @@ protected:
     }
 
     static const unsigned int kRows = 700;
+    testsupport::LockStore locks;
     testsupport::TempDir dir;
-    testsupport::TempDir locks;
     std::wstring wdir;
-    char savedStore[sizeof LinuxSharedMutex::storePath];
     std::unique_ptr<FS_Table> t;
     std::map<std::string, std::string> pristine;
     unsigned int damagedSeen = 0;
@@ -348,17 +342,25 @@ TEST_P(TableSkipTest, EveryDamageOfAnIndexEndsBothWalksAlike) {
 
 INSTANTIATE_TEST_SUITE_P(PlainAndCompressed, TableSkipTest, ::testing::Values(false, true));
 
+// A table of its own in a directory of its own, for the tests below, with a
+// lock store of its own.
+class TableSkipOwnTable : public ::testing::Test {
+protected:
+    void SetUp() override { ASSERT_TRUE(locks.ok()); }
+    testsupport::LockStore locks;
+    testsupport::TempDir dir;
+    std::wstring wdir = wide(dir.path() + "/");
+};
+using TableSkipWideKey = TableSkipOwnTable;
+using TableSkipKeyLengths = TableSkipOwnTable;
+using TableSkipColumns = TableSkipOwnTable;
+
 // A compressed 16-bit key stored with bits above its width (a 3-byte group
 // number has room for 21) is cut to 16 bits by the full read, so its row is
 // filed where the cut value belongs.  The rows skipRejected passes over must
 // cut it the same way: uncut, the key would not be where its row is filed,
 // and the table would leave every such row to be decided one by one.
-TEST(TableSkipWideKey, AKeyStoredWiderThanItsColumnIsCutAsTheFullReadCutsIt) {
-    testsupport::TempDir dir, locks;
-    char saved[sizeof LinuxSharedMutex::storePath];
-    std::memcpy(saved, LinuxSharedMutex::storePath, sizeof saved);
-    ASSERT_TRUE(LinuxSharedMutex::setStorePath(locks.path().c_str()));
-    std::wstring wdir = wide(dir.path() + "/");
+TEST_F(TableSkipWideKey, AKeyStoredWiderThanItsColumnIsCutAsTheFullReadCutsIt) {
     const unsigned int kRows = 60;
     const unsigned short kWide = 40000;  // groups 2, 56, 64: bytes 05 71 80
     {
@@ -396,7 +398,6 @@ TEST(TableSkipWideKey, AKeyStoredWiderThanItsColumnIsCutAsTheFullReadCutsIt) {
     };
     Walk rowByRow = walk(false);
     Walk skipping = walk(true);
-    std::memcpy(LinuxSharedMutex::storePath, saved, sizeof saved);
     EXPECT_TRUE(rowByRow.verified);
     EXPECT_EQ(rowByRow, skipping);
     // The rows between two ".c" names were passed over inside the table.
@@ -414,12 +415,7 @@ TEST(TableSkipWideKey, AKeyStoredWiderThanItsColumnIsCutAsTheFullReadCutsIt) {
 // decoder; a run stepped over at once where it fits eight bytes, number by
 // number where not), or their keys would not be where the index files them
 // and every row would be decided one by one.
-TEST(TableSkipKeyLengths, AKeyOfEveryStoredLengthIsReadAsTheFullReadReadsIt) {
-    testsupport::TempDir dir, locks;
-    char saved[sizeof LinuxSharedMutex::storePath];
-    std::memcpy(saved, LinuxSharedMutex::storePath, sizeof saved);
-    ASSERT_TRUE(LinuxSharedMutex::setStorePath(locks.path().c_str()));
-    std::wstring wdir = wide(dir.path() + "/");
+TEST_F(TableSkipKeyLengths, AKeyOfEveryStoredLengthIsReadAsTheFullReadReadsIt) {
     // The largest and the smallest value of each length: 7 bits a byte.
     std::vector<unsigned long long> values;
     for (unsigned int bits = 7; bits < 64; bits += 7) {
@@ -457,7 +453,6 @@ TEST(TableSkipKeyLengths, AKeyOfEveryStoredLengthIsReadAsTheFullReadReadsIt) {
     };
     Walk rowByRow = walk(false);
     Walk skipping = walk(true);
-    std::memcpy(LinuxSharedMutex::storePath, saved, sizeof saved);
     EXPECT_TRUE(rowByRow.verified);
     EXPECT_EQ(rowByRow, skipping);
     EXPECT_EQ(rowByRow.decided, kRows);
@@ -474,12 +469,7 @@ TEST(TableSkipKeyLengths, AKeyOfEveryStoredLengthIsReadAsTheFullReadReadsIt) {
 // another order (the filtered column and the key where they were): each
 // walk skims the rows for its own columns, not for those of the walk before,
 // and passes over every row it turns away.
-TEST(TableSkipColumns, EachWalkSkimsForItsOwnColumns) {
-    testsupport::TempDir dir, locks;
-    char saved[sizeof LinuxSharedMutex::storePath];
-    std::memcpy(saved, LinuxSharedMutex::storePath, sizeof saved);
-    ASSERT_TRUE(LinuxSharedMutex::setStorePath(locks.path().c_str()));
-    std::wstring wdir = wide(dir.path() + "/");
+TEST_F(TableSkipColumns, EachWalkSkimsForItsOwnColumns) {
     const unsigned int kRows = 90;
     // NAME ends in ".c" on every 10th row, OTHER on every 7th; the number
     // between them is long enough to move OTHER when it is not stepped over.
@@ -528,7 +518,6 @@ TEST(TableSkipColumns, EachWalkSkimsForItsOwnColumns) {
         }
         t.close();
     }
-    std::memcpy(LinuxSharedMutex::storePath, saved, sizeof saved);
 }
 
 }  // namespace

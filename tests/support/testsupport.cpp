@@ -5,9 +5,12 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <fstream>
 #include <sstream>
 #include <stdexcept>
+
+#include "fscanner/fscommon/sync.h"
 
 namespace testsupport {
 
@@ -24,6 +27,12 @@ TempDir::TempDir() {
 TempDir::~TempDir() { removeTree(path_); }
 
 std::string TempDir::file(const std::string& relative) const { return path_ + "/" + relative; }
+
+LockStore::LockStore()
+    : saved_(LinuxSharedMutex::storePath, sizeof LinuxSharedMutex::storePath),
+      ok_(LinuxSharedMutex::setStorePath(dir_.path().c_str())) {}
+
+LockStore::~LockStore() { std::memcpy(LinuxSharedMutex::storePath, saved_.data(), saved_.size()); }
 
 std::string TempDir::mkdirs(const std::string& relative) const {
     std::string full = path_;

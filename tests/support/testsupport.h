@@ -41,6 +41,23 @@ bool fileExists(const std::string& path);
 // Removes a tree; permissions are restored first so unreadable fixtures go too.
 void removeTree(const std::string& path);
 
+// Points the lock files of the shared mutexes at a directory of its own
+// while it lives, and puts the store that was set before back after.
+class LockStore {
+public:
+    LockStore();
+    ~LockStore();
+    LockStore(const LockStore&) = delete;
+    LockStore& operator=(const LockStore&) = delete;
+    // False when the store could not be set (the path too long).
+    bool ok() const { return ok_; }
+
+private:
+    TempDir dir_;
+    std::string saved_;
+    bool ok_ = false;
+};
+
 // Captures every trace message while it lives.
 class TraceCapture {
 public:
